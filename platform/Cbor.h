@@ -6,6 +6,8 @@
 // The decoder accepts exactly one data item with definite lengths and refuses, with the byte
 // offset in the error: nesting deeper than kMaxDepth, non-text map keys, duplicate keys, invalid
 // UTF-8, tags other than 1 and 37, null, undefined, other simple values, and trailing bytes.
+// Depth counts containers (a scalar alone is at depth 0, [1] at depth 1): 128 nested arrays
+// decode, 129 do not.
 #pragma once
 
 #include <cstdint>
