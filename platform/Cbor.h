@@ -22,6 +22,10 @@ namespace om {
 class Cbor {
 public:
     static constexpr unsigned kMaxDepth = 128;
+    // Item heads (scalars, containers, tags) one decode accepts. A one-byte item becomes a Value
+    // of some fifty bytes, so without this bound a 16 MiB frame of tiny items would cost the
+    // receiver over a gigabyte; with it, about a hundred megabytes at worst.
+    static constexpr size_t kMaxItems = size_t(1) << 20;
 
     // Appends the encoding of value to out. value and everything in it must not be none.
     static void encode(const Value& value, std::vector<uint8_t>& out);

@@ -120,6 +120,10 @@ Result<Value> CborDecoder::run()
             break;
         }
         m_itemStart = offset;
+        if (++m_heads > Cbor::kMaxItems) {
+            fail(kPlatformErrorLimit, "more than " + std::to_string(Cbor::kMaxItems) + " items", offset);
+            break;
+        }
         const auto result
             = cbor_stream_decode(m_bytes.data() + offset, m_bytes.size() - offset, &Callbacks::table, this);
         if (result.status == CBOR_DECODER_NEDATA)

@@ -79,6 +79,7 @@ private:
     // so a header whose count would push this past the bytes remaining is refused before any
     // memory is reserved for it, however deeply such headers are nested.
     uint64_t m_pendingItems = 0;
+    size_t m_heads = 0; // item heads read so far, against Cbor::kMaxItems
     uint64_t m_tag = 0; // the tag waiting for its item, 0 when none
     size_t m_tagStart = 0;
     std::vector<Frame> m_stack;

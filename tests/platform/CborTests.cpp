@@ -510,6 +510,24 @@ TEST(Cbor, HugeLengthHeadersFailBeforeAnyAllocation)
     EXPECT_TRUE(malformed({ 0xa2, 0x60, 0x00, 0x60 }, "map of 2 entries longer than the 3 bytes remaining at byte 0"));
 }
 
+TEST(Cbor, ItemCountIsBoundedWhateverTheBytesAllow)
+{
+    // An array header and its elements: kMaxItems heads in all decode, one more is refused.
+    auto arrayOfZeros = [](size_t elements) {
+        Bytes bytes { 0x9a, uint8_t(elements >> 24), uint8_t(elements >> 16), uint8_t(elements >> 8),
+            uint8_t(elements) };
+        bytes.resize(bytes.size() + elements, 0x00);
+        return bytes;
+    };
+    auto fits = Cbor::decode(arrayOfZeros(Cbor::kMaxItems - 1));
+    ASSERT_TRUE(fits.ok()) << fits.error().localizedDescription();
+    EXPECT_EQ(fits->count(), Cbor::kMaxItems - 1);
+    auto over = Cbor::decode(arrayOfZeros(Cbor::kMaxItems));
+    ASSERT_FALSE(over.ok());
+    EXPECT_EQ(over.error().code(), om::kPlatformErrorLimit);
+    EXPECT_NE(over.error().localizedDescription().find("more than 1048576 items"), std::string::npos);
+}
+
 TEST(Cbor, NestedCountsAreChargedAgainstTheSameBytes)
 {
     // Each header alone fits in what follows it, but not together with the items already promised:
