@@ -1,0 +1,46 @@
+// Facts about a peer process, taken from the kernel, never from what the peer says.
+//
+// An AuditToken is captured when a connection is accepted: pid, uid and gid from SO_PEERCRED and a
+// pidfd from SO_PEERPIDFD (or pidfd_open as a fallback on kernels without it). Everything later
+// asked about the process is checked against the pidfd, so a pid that was reused by another
+// process is never trusted.
+#pragma once
+
+#include <sys/types.h>
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "platform/Result.h"
+#include "platform/UniqueFd.h"
+
+namespace om {
+
+struct AuditToken {
+    pid_t pid = -1;
+    uid_t uid = static_cast<uid_t>(-1);
+    gid_t gid = static_cast<gid_t>(-1);
+    std::shared_ptr<const UniqueFd> pidfd;  // may be empty when the kernel gave none
+};
+
+class Process {
+public:
+    // The peer of a connected Unix socket.
+    static Result<AuditToken> peerOf(int socketFd);
+    // The token of this process (for tests and for the daemon's own identity).
+    static AuditToken self();
+
+    // /proc/<pid>/exe, verified: fails when the process is gone or the pid was reused.
+    static Result<std::string> executablePath(const AuditToken& token);
+    // Opens the executable read-only through /proc/<pid>/exe (works even when the file was
+    // replaced on disk), verified against the pidfd like executablePath.
+    static Result<UniqueFd> openExecutable(const AuditToken& token);
+    // True when the process's user or mount namespace differs from ours, or it runs under a
+    // seccomp filter.
+    static bool isSandboxed(const AuditToken& token);
+    // Whether the process behind the token is still the one it was.
+    static bool isAlive(const AuditToken& token);
+};
+
+} // namespace om
