@@ -1,0 +1,215 @@
+#include "platform/ConduitFrame.h"
+
+#include "platform/Cbor.h"
+#include "platform/CborDecoder.h"
+#include "platform/Conduit.h"
+
+namespace om {
+
+namespace {
+
+constexpr size_t kLengthSize = 4;
+constexpr size_t kKindOffset = 4;
+constexpr size_t kIdOffset = 5;
+constexpr uint64_t kMaxLength = ConduitFrame::kMinLength + uint64_t(Conduit::kMaxPayload);
+// A buffer that once held a large frame is given back when it empties, so that one big message
+// does not pin its size for the life of the connection.
+constexpr size_t kRetainedCapacity = 1u << 20;
+
+uint32_t readLe32(const uint8_t* bytes)
+{
+    return uint32_t(bytes[0]) | uint32_t(bytes[1]) << 8 | uint32_t(bytes[2]) << 16 | uint32_t(bytes[3]) << 24;
+}
+
+uint64_t readLe64(const uint8_t* bytes)
+{
+    uint64_t value = 0;
+    for (int i = 7; i >= 0; --i)
+        value = value << 8 | bytes[i];
+    return value;
+}
+
+void writeLe(uint8_t* out, uint64_t value, size_t size)
+{
+    for (size_t i = 0; i < size; ++i, value >>= 8)
+        out[i] = uint8_t(value & 0xff);
+}
+
+bool isKnownKind(uint8_t kind)
+{
+    return kind >= uint8_t(ConduitFrame::Kind::Message) && kind <= uint8_t(ConduitFrame::Kind::TerminationImminent);
+}
+
+std::optional<std::string> checkCarriable(const Value& value, unsigned depth)
+{
+    switch (value.type()) {
+    case Value::Type::None:
+        return std::string("a none value");
+    case Value::Type::String: {
+        const auto& text = *value.asString();
+        if (CborDecoder::invalidUtf8Offset({reinterpret_cast<const uint8_t*>(text.data()), text.size()}))
+            return std::string("text that is not UTF-8");
+        return std::nullopt;
+    }
+    case Value::Type::Array:
+    case Value::Type::Dictionary:
+        break;
+    default:
+        return std::nullopt;
+    }
+    if (depth >= Cbor::kMaxDepth)
+        return "nesting deeper than " + std::to_string(Cbor::kMaxDepth) + " levels";
+    for (const auto& element : value.elements()) {
+        if (auto problem = checkCarriable(element, depth + 1))
+            return problem;
+    }
+    for (const auto& [key, element] : value.entries()) {
+        if (CborDecoder::invalidUtf8Offset({reinterpret_cast<const uint8_t*>(key.data()), key.size()}))
+            return std::string("a key that is not UTF-8");
+        if (auto problem = checkCarriable(element, depth + 1))
+            return problem;
+    }
+    return std::nullopt;
+}
+
+} // namespace
+
+std::optional<std::string> ConduitFrame::whyNotCarriable(const Value& value)
+{
+    return checkCarriable(value, 0);
+}
+
+Result<std::vector<uint8_t>> ConduitFrame::encode(Kind kind, uint64_t id, const Value& payload)
+{
+    std::vector<uint8_t> frame(kHeaderSize);
+    if (kind != Kind::TerminationImminent) {
+        if (auto problem = whyNotCarriable(payload))
+            return OMError::platform(kPlatformErrorUnsupported, "message holds " + *problem);
+        Cbor::encode(payload, frame);
+    }
+    const size_t payloadSize = frame.size() - kHeaderSize;
+    if (payloadSize > Conduit::kMaxPayload)
+        return OMError::platform(kPlatformErrorLimit, "message of " + std::to_string(payloadSize) +
+                                                          " bytes exceeds the frame limit");
+    writeLe(frame.data(), kMinLength + payloadSize, kLengthSize);
+    frame[kKindOffset] = uint8_t(kind);
+    writeLe(frame.data() + kIdOffset, id, 8);
+    return frame;
+}
+
+void ConduitFrame::setId(std::vector<uint8_t>& frame, uint64_t id)
+{
+    writeLe(frame.data() + kIdOffset, id, 8);
+}
+
+void ConduitFrameReader::append(std::span<const uint8_t> bytes)
+{
+    if (m_error || bytes.empty())
+        return;
+    if (m_offset == m_buffer.size()) {
+        if (m_buffer.capacity() > kRetainedCapacity)
+            m_buffer = {};
+        m_buffer.clear();
+        m_offset = 0;
+    } else if (m_offset > 0 && m_offset >= m_buffer.size() / 2) {
+        m_buffer.erase(m_buffer.begin(), m_buffer.begin() + ptrdiff_t(m_offset));
+        m_offset = 0;
+    }
+    m_buffer.insert(m_buffer.end(), bytes.begin(), bytes.end());
+}
+
+// Judges the header of the frame in progress with whatever part of it has arrived, so that a bad
+// length or kind is refused before the body is waited for.
+std::optional<OMError> ConduitFrameReader::checkHeader() const
+{
+    const size_t available = buffered();
+    const uint8_t* header = m_buffer.data() + m_offset;
+    if (available < kLengthSize)
+        return std::nullopt;
+    const uint32_t length = readLe32(header);
+    if (length < ConduitFrame::kMinLength || length > kMaxLength)
+        return OMError::platform(kPlatformErrorLimit, "frame length " + std::to_string(length) + " out of range");
+    if (available <= kKindOffset)
+        return std::nullopt;
+    const uint8_t kind = header[kKindOffset];
+    if (!isKnownKind(kind))
+        return OMError::platform(kPlatformErrorMalformed, "unknown frame kind " + std::to_string(kind));
+    const auto frameKind = ConduitFrame::Kind(kind);
+    if (frameKind == ConduitFrame::Kind::TerminationImminent && length != ConduitFrame::kMinLength)
+        return OMError::platform(kPlatformErrorMalformed, "termination frame with a payload");
+    if (frameKind != ConduitFrame::Kind::TerminationImminent && length == ConduitFrame::kMinLength)
+        return OMError::platform(kPlatformErrorMalformed, "frame of kind " + std::to_string(kind) + " without a payload");
+    if (available < ConduitFrame::kHeaderSize)
+        return std::nullopt;
+    const uint64_t id = readLe64(header + kIdOffset);
+    switch (frameKind) {
+    case ConduitFrame::Kind::Request:
+        if (id == 0)
+            return OMError::platform(kPlatformErrorMalformed, "request with id 0");
+        if (id <= m_lastRequestId)
+            return OMError::platform(kPlatformErrorMalformed, "request id " + std::to_string(id) +
+                                                                  " not above " + std::to_string(m_lastRequestId));
+        break;
+    case ConduitFrame::Kind::Reply:
+        break;  // whether it answers anything is the connection's to say
+    case ConduitFrame::Kind::Message:
+    case ConduitFrame::Kind::TerminationImminent:
+        if (id != 0)
+            return OMError::platform(kPlatformErrorMalformed, "frame of kind " + std::to_string(kind) +
+                                                                  " with id " + std::to_string(id));
+        break;
+    }
+    return std::nullopt;
+}
+
+Result<std::optional<ConduitFrame>> ConduitFrameReader::next()
+{
+    if (m_error)
+        return *m_error;
+    if (auto problem = checkHeader())
+        return fail(problem->localizedDescription());
+    if (buffered() < ConduitFrame::kHeaderSize)
+        return std::optional<ConduitFrame>();
+    const uint8_t* header = m_buffer.data() + m_offset;
+    const uint32_t length = readLe32(header);
+    if (buffered() < kLengthSize + length)
+        return std::optional<ConduitFrame>();
+
+    ConduitFrame frame;
+    frame.kind = ConduitFrame::Kind(header[kKindOffset]);
+    frame.id = readLe64(header + kIdOffset);
+    std::span<const uint8_t> payload(header + ConduitFrame::kHeaderSize, length - ConduitFrame::kMinLength);
+    m_offset += kLengthSize + length;
+
+    if (frame.kind == ConduitFrame::Kind::Request)
+        m_lastRequestId = frame.id;
+    if (frame.kind != ConduitFrame::Kind::TerminationImminent) {
+        auto decoded = Cbor::decode(payload);
+        if (!decoded.ok())
+            return fail("malformed payload: " + decoded.error().localizedDescription());
+        frame.payload = std::move(decoded).releaseValue();
+    }
+    return std::optional<ConduitFrame>(std::move(frame));
+}
+
+std::optional<OMError> ConduitFrameReader::finish() const
+{
+    if (m_error || buffered() == 0)
+        return std::nullopt;
+    if (buffered() < ConduitFrame::kHeaderSize)
+        return OMError::platform(kPlatformErrorMalformed, "stream ended inside a frame header (" +
+                                                              std::to_string(buffered()) + " bytes)");
+    return OMError::platform(kPlatformErrorMalformed, "stream ended inside a frame (" + std::to_string(buffered()) +
+                                                          " of " + std::to_string(kLengthSize + readLe32(m_buffer.data() + m_offset)) +
+                                                          " bytes)");
+}
+
+OMError ConduitFrameReader::fail(std::string what)
+{
+    m_error = OMError::platform(kPlatformErrorMalformed, std::move(what));
+    m_buffer = {};
+    m_offset = 0;
+    return *m_error;
+}
+
+} // namespace om

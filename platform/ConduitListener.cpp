@@ -1,0 +1,261 @@
+#include <fcntl.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+
+#include <cerrno>
+#include <cstring>
+
+#include "platform/Conduit.h"
+#include "platform/ConduitConnectionState.h"
+#include "platform/ConduitIoThread.h"
+
+namespace om {
+
+namespace {
+
+Result<sockaddr_un> addressOf(const std::string& path)
+{
+    sockaddr_un address {};
+    address.sun_family = AF_UNIX;
+    if (path.size() >= sizeof address.sun_path)
+        return OMError::platform(kPlatformErrorLimit, "socket path too long: " + path);
+    std::memcpy(address.sun_path, path.c_str(), path.size() + 1);
+    return address;
+}
+
+// mkdir -p with mode 0755 for the parts that do not exist yet.
+Result<void> makeDirectories(const std::string& directory)
+{
+    for (size_t slash = directory.find('/', 1);; slash = directory.find('/', slash + 1)) {
+        const std::string prefix = directory.substr(0, slash);
+        if (!prefix.empty() && ::mkdir(prefix.c_str(), 0755) < 0 && errno != EEXIST)
+            return OMError::fromErrno("mkdir " + prefix, errno);
+        if (slash == std::string::npos)
+            break;
+    }
+    struct stat info;
+    if (::stat(directory.c_str(), &info) < 0)
+        return OMError::fromErrno("stat " + directory, errno);
+    if (!S_ISDIR(info.st_mode))
+        return OMError::platform(kPlatformErrorUnsupported, directory + " is not a directory");
+    return {};
+}
+
+// The name is taken when something answers at path; a socket that refuses connections is what a
+// listener that died left behind, and is removed.
+Result<void> removeIfStale(const std::string& path, const sockaddr_un& address)
+{
+    struct stat info;
+    if (::lstat(path.c_str(), &info) < 0)
+        return errno == ENOENT ? Result<void>() : Result<void>(OMError::fromErrno("lstat " + path, errno));
+    if (!S_ISSOCK(info.st_mode))
+        return OMError::platform(kPlatformErrorUnsupported, path + " exists and is not a socket");
+    UniqueFd probe(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+    if (!probe.valid())
+        return OMError::fromErrno("socket", errno);
+    if (::connect(probe.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0 || errno == EAGAIN)
+        return OMError::platform(kPlatformErrorUnsupported, "a live listener already owns " + path);
+    if (errno != ECONNREFUSED && errno != ENOENT)
+        return OMError::fromErrno("connect " + path, errno);
+    if (::unlink(path.c_str()) < 0 && errno != ENOENT)
+        return OMError::fromErrno("unlink " + path, errno);
+    return {};
+}
+
+Result<UniqueFd> bindListeningSocket(const std::string& path)
+{
+    const sockaddr_un address = OM_TRY(addressOf(path));
+    UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
+    if (!fd.valid())
+        return OMError::fromErrno("socket", errno);
+    const auto* raw = reinterpret_cast<const sockaddr*>(&address);
+    if (::bind(fd.get(), raw, sizeof address) < 0) {
+        if (errno != EADDRINUSE)
+            return OMError::fromErrno("bind " + path, errno);
+        OM_TRY(removeIfStale(path, address));
+        if (::bind(fd.get(), raw, sizeof address) < 0)
+            return OMError::fromErrno("bind " + path, errno);
+    }
+    // Everyone may connect: what a peer may do is decided by its entitlements, not by this mode.
+    if (::chmod(path.c_str(), 0666) < 0)
+        return OMError::fromErrno("chmod " + path, errno);
+    if (::listen(fd.get(), SOMAXCONN) < 0)
+        return OMError::fromErrno("listen " + path, errno);
+    return fd;
+}
+
+} // namespace
+
+struct ConduitListener::State {
+    // The I/O thread's registration. It holds the listener weakly: dropping the last handle to a
+    // listener stops it.
+    struct Watcher final : ConduitIoThread::Source {
+        std::weak_ptr<ConduitListener> listener;
+        void handleEvents(uint32_t) override
+        {
+            if (auto strong = listener.lock())
+                strong->m_state->acceptPending(*strong);
+        }
+    };
+
+    State(std::string socketPath, UniqueFd socket, std::shared_ptr<WorkQueue> deliveryQueue)
+        : path(std::move(socketPath)), queue(std::move(deliveryQueue)), socket(std::make_shared<UniqueFd>(std::move(socket)))
+    {
+        struct stat info;
+        if (::stat(path.c_str(), &info) == 0) {
+            device = info.st_dev;
+            inode = info.st_ino;
+        }
+    }
+
+    void start(const std::shared_ptr<ConduitListener>& owner);
+    void acceptPending(ConduitListener& owner);
+    void deliver(const std::shared_ptr<ConduitListener>& owner, std::shared_ptr<ConduitConnection> connection);
+    void shutdown();
+
+    const std::string path;
+    const std::shared_ptr<WorkQueue> queue;  // null: the I/O thread
+    ConnectionHandler handler;               // set before resume()
+    std::atomic<bool> resumed {false};
+    std::atomic<bool> cancelled {false};
+
+    std::mutex mutex;
+    std::shared_ptr<UniqueFd> socket;  // shared with the I/O thread's cleanup
+    uint64_t ioKey = 0;
+    dev_t device = 0;  // identity of the socket file we bound, so that we unlink only our own
+    ino_t inode = 0;
+};
+
+void ConduitListener::State::start(const std::shared_ptr<ConduitListener>& owner)
+{
+    std::lock_guard lock(mutex);
+    if (cancelled.load() || !socket->valid())
+        return;
+    auto watcher = std::make_shared<Watcher>();
+    watcher->listener = owner;
+    ioKey = ConduitIoThread::shared().add(socket->get(), EPOLLIN, std::move(watcher));
+}
+
+void ConduitListener::State::acceptPending(ConduitListener& owner)
+{
+    // One descriptor held back for the moment the process runs out: closing it lets us accept
+    // and drop the waiting peer, instead of the listener staying readable and spinning the loop.
+    static int reserve = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
+    std::shared_ptr<UniqueFd> listening;
+    {
+        std::lock_guard lock(mutex);
+        listening = socket;  // shutdown() may swap it out from another thread
+    }
+    if (!listening->valid())
+        return;
+    for (;;) {
+        UniqueFd peer(::accept4(listening->get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
+        if (!peer.valid()) {
+            if (errno == EINTR || errno == ECONNABORTED)
+                continue;
+            if ((errno == EMFILE || errno == ENFILE) && reserve >= 0) {
+                ConduitIoThread::log().error("accept on %s: %s; dropping a peer", path, std::strerror(errno));
+                ::close(reserve);
+                UniqueFd dropped(::accept4(listening->get(), nullptr, nullptr, SOCK_CLOEXEC));
+                reserve = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
+                continue;
+            }
+            if (errno != EAGAIN && errno != EWOULDBLOCK)
+                ConduitIoThread::log().error("accept on %s: %s", path, std::strerror(errno));
+            return;
+        }
+        auto token = Process::peerOf(peer.get());
+        if (!token.ok()) {
+            ConduitIoThread::log().error("new connection on %s: %s; closing it", path,
+                                         token.error().localizedDescription());
+            continue;
+        }
+        auto connection = ConduitConnection::State::make(ConduitConnection::State::Role::Peer, std::move(peer),
+                                                         std::move(token).releaseValue(), std::string());
+        ConduitIoThread::shared().addPeer(connection);
+        deliver(owner.shared_from_this(), std::move(connection));
+    }
+}
+
+void ConduitListener::State::deliver(const std::shared_ptr<ConduitListener>& owner,
+                                     std::shared_ptr<ConduitConnection> connection)
+{
+    auto hand = [owner, connection = std::move(connection)] {
+        auto& state = *owner->m_state;
+        // Undelivered connections of a cancelled listener close when this last reference goes.
+        if (!state.cancelled.load() && state.handler)
+            state.handler(connection);
+    };
+    if (queue)
+        queue->async(std::move(hand));
+    else
+        hand();
+}
+
+void ConduitListener::State::shutdown()
+{
+    if (cancelled.exchange(true))
+        return;
+    std::shared_ptr<UniqueFd> closing;
+    uint64_t key = 0;
+    {
+        std::lock_guard lock(mutex);
+        closing = std::move(socket);
+        socket = std::make_shared<UniqueFd>();
+        key = std::exchange(ioKey, 0);
+    }
+    struct stat info;
+    if (::stat(path.c_str(), &info) == 0 && info.st_dev == device && info.st_ino == inode)
+        (void)::unlink(path.c_str());  // a successor may already have replaced it: that is fine
+    if (key == 0)
+        return;  // never registered: closing drops the descriptor here
+    // A registered descriptor is closed on the I/O thread, after its registration is gone, so
+    // that no event of a reused descriptor number can reach a stale registration.
+    ConduitIoThread::shared().run([closing, key] { ConduitIoThread::shared().remove(closing->get(), key); });
+}
+
+ConduitListener::ConduitListener() = default;
+
+ConduitListener::~ConduitListener()
+{
+    m_state->shutdown();
+}
+
+Result<std::shared_ptr<ConduitListener>> ConduitListener::create(const std::string& serviceName,
+                                                                 std::shared_ptr<WorkQueue> queue)
+{
+    if (!Conduit::isValidServiceName(serviceName))
+        return OMError::platform(kPlatformErrorUnsupported, "invalid service name \"" + serviceName + "\"");
+    OM_TRY(makeDirectories(Conduit::directory()));
+    const std::string path = Conduit::socketPath(serviceName);
+    UniqueFd socket = OM_TRY(bindListeningSocket(path));
+    std::shared_ptr<ConduitListener> listener(new ConduitListener());
+    listener->m_state = std::make_unique<State>(path, std::move(socket), std::move(queue));
+    return listener;
+}
+
+void ConduitListener::setConnectionHandler(ConnectionHandler handler)
+{
+    if (!m_state->resumed.load())
+        m_state->handler = std::move(handler);
+}
+
+void ConduitListener::resume()
+{
+    if (m_state->resumed.exchange(true))
+        return;
+    ConduitIoThread::shared().post([self = shared_from_this()] { self->m_state->start(self); });
+}
+
+void ConduitListener::cancel()
+{
+    m_state->shutdown();
+}
+
+const std::string& ConduitListener::socketPath() const
+{
+    return m_state->path;
+}
+
+} // namespace om
