@@ -1,0 +1,230 @@
+#include "platform/WorkQueue.h"
+
+#include <pthread.h>
+#include <sys/resource.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <optional>
+#include <vector>
+
+#include "platform/Fatal.h"
+
+namespace om {
+
+namespace {
+
+// The queues the calling thread is on: its own queue for a queue thread, plus every queue it holds
+// through sync(). Nested sync into another queue pushes a second entry.
+thread_local std::vector<const WorkQueue*> t_currentQueues;
+
+// Set by ~WorkQueue when the last reference was dropped on the queue's own thread: what was still
+// queued, to be run by that thread after it has left every member of the dead queue behind.
+thread_local std::optional<std::deque<std::function<void()>>> t_orphanedItems;
+
+// The handshake of one sync() call. Shared with the barrier item, which may still be waking up on
+// the queue thread when the caller returns.
+struct SyncBarrier {
+    std::mutex mutex;
+    std::condition_variable changed;
+    bool held = false;
+    bool released = false;
+
+    // Runs on the queue thread: everything queued earlier has run; park until the caller is done.
+    void holdQueue()
+    {
+        std::unique_lock lock(mutex);
+        held = true;
+        changed.notify_all();
+        changed.wait(lock, [this] { return released; });
+    }
+    void waitUntilHeld()
+    {
+        std::unique_lock lock(mutex);
+        changed.wait(lock, [this] { return held; });
+    }
+    void release()
+    {
+        std::lock_guard lock(mutex);
+        released = true;
+        changed.notify_all();
+    }
+};
+
+int niceValue(QualityOfService qos, int relativePriority)
+{
+    int base = 0;
+    switch (qos) {
+    case QualityOfService::Background:
+        base = 10;
+        break;
+    case QualityOfService::Utility:
+        base = 5;
+        break;
+    case QualityOfService::Default:
+        base = 0;
+        break;
+    case QualityOfService::UserInitiated:
+        base = -5;
+        break;
+    case QualityOfService::UserInteractive:
+        base = -10;
+        break;
+    }
+    // A relative priority lowers the thread within its class: -15 (lowest) ... 0.
+    relativePriority = std::clamp(relativePriority, -15, 0);
+    return base - relativePriority / 3;
+}
+
+// Without CAP_SYS_NICE a thread may not go below 20 - RLIMIT_NICE, nor below where it already is.
+int clampToPermitted(int nice)
+{
+    errno = 0;
+    int current = ::getpriority(PRIO_PROCESS, static_cast<id_t>(::gettid()));
+    if (current == -1 && errno != 0)
+        current = 0;
+    struct rlimit limit;
+    int floor = -20;
+    if (::getrlimit(RLIMIT_NICE, &limit) == 0 && limit.rlim_cur != RLIM_INFINITY)
+        floor = 20 - static_cast<int>(std::min<rlim_t>(limit.rlim_cur, 40));
+    return std::clamp(nice, std::min(floor, current), 19);
+}
+
+void applyThreadAttributes(const std::string& label, QualityOfService qos, int relativePriority)
+{
+    // The kernel keeps 15 bytes of a thread name.
+    std::string name = label.substr(0, 15);
+    (void)::pthread_setname_np(::pthread_self(), name.c_str());
+
+    int nice = clampToPermitted(niceValue(qos, relativePriority));
+    // Privilege can still be missing (a container without CAP_SYS_NICE): the queue then keeps the
+    // inherited priority, which changes its speed, never its behaviour.
+    (void)::setpriority(PRIO_PROCESS, static_cast<id_t>(::gettid()), nice);
+}
+
+void runOrphans(std::deque<std::function<void()>> items)
+{
+    while (!items.empty()) {
+        auto item = std::move(items.front());
+        items.pop_front();
+        item();
+    }
+}
+
+} // namespace
+
+std::shared_ptr<WorkQueue> WorkQueue::create(std::string label, QualityOfService qos, int relativePriority)
+{
+    return std::shared_ptr<WorkQueue>(new WorkQueue(std::move(label), qos, relativePriority));
+}
+
+WorkQueue::WorkQueue(std::string label, QualityOfService qos, int relativePriority)
+    : m_label(std::move(label))
+    , m_qos(qos)
+    , m_relativePriority(relativePriority)
+{
+    m_thread = std::thread([this] { run(); });
+}
+
+WorkQueue::~WorkQueue()
+{
+    if (std::this_thread::get_id() == m_thread.get_id()) {
+        // One of our own items dropped the last reference. This thread cannot join itself: it
+        // runs what is left once the current item returns, without this object, and then ends.
+        std::lock_guard lock(m_mutex);
+        t_orphanedItems.emplace(std::move(m_items));
+        std::erase(t_currentQueues, this);
+        m_thread.detach();
+        return;
+    }
+    {
+        std::lock_guard lock(m_mutex);
+        m_stopping = true;
+        m_wake.notify_all();
+    }
+    m_thread.join();
+}
+
+void WorkQueue::async(std::function<void()> work)
+{
+    // Notify under the lock: once the item is visible the queue thread may run it, and if it holds
+    // the last reference, destroy this queue before an unlocked notify would touch m_wake.
+    std::lock_guard lock(m_mutex);
+    m_items.push_back(std::move(work));
+    m_wake.notify_one();
+}
+
+void WorkQueue::sync(const std::function<void()>& work)
+{
+    if (isCurrent())
+        internalInconsistency("sync onto work queue \"" + m_label + "\" from code already running on it");
+
+    auto protect = shared_from_this(); // the closure may drop the caller's reference to this queue
+    auto barrier = std::make_shared<SyncBarrier>();
+    async([barrier] { barrier->holdQueue(); });
+    barrier->waitUntilHeld();
+
+    struct Hold {
+        const WorkQueue* queue;
+        SyncBarrier& barrier;
+        Hold(const WorkQueue* q, SyncBarrier& b)
+            : queue(q)
+            , barrier(b)
+        {
+            t_currentQueues.push_back(queue);
+        }
+        ~Hold()
+        {
+            t_currentQueues.pop_back();
+            barrier.release();
+        }
+    } hold(this, *barrier);
+    work();
+}
+
+bool WorkQueue::isCurrent() const
+{
+    return std::find(t_currentQueues.begin(), t_currentQueues.end(), this) != t_currentQueues.end();
+}
+
+void WorkQueue::assertCurrent() const
+{
+    if (!isCurrent())
+        internalInconsistency("expected to run on work queue \"" + m_label + "\"");
+}
+
+void WorkQueue::assertNotCurrent() const
+{
+    if (isCurrent())
+        internalInconsistency("must not run on work queue \"" + m_label + "\"");
+}
+
+void WorkQueue::run()
+{
+    applyThreadAttributes(m_label, m_qos, m_relativePriority);
+    t_currentQueues.push_back(this);
+    for (;;) {
+        std::function<void()> item;
+        {
+            std::unique_lock lock(m_mutex);
+            m_wake.wait(lock, [this] { return m_stopping || !m_items.empty(); });
+            if (m_items.empty())
+                break;
+            item = std::move(m_items.front());
+            m_items.pop_front();
+        }
+        item();
+        item = nullptr; // may release the last reference to this queue
+        if (t_orphanedItems) {
+            // This queue is gone: touch no member from here on.
+            auto orphans = std::move(*t_orphanedItems);
+            t_orphanedItems.reset();
+            runOrphans(std::move(orphans));
+            return;
+        }
+    }
+    t_currentQueues.pop_back();
+}
+
+} // namespace om
