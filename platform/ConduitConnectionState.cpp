@@ -217,6 +217,10 @@ void ConduitConnection::State::readAvailable()
             m_reader.append({chunk, size_t(count)});
             if (!drainFrames())
                 return;
+            // A short read emptied the socket; epoll is level-triggered, so anything arriving
+            // later wakes us again, and a second recv here would only return EAGAIN.
+            if (size_t(count) < sizeof chunk)
+                return;
             continue;
         }
         if (count == 0)

@@ -1,3 +1,4 @@
+#include <atomic>
 #include <fcntl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -42,9 +43,9 @@ Result<void> makeDirectories(const std::string& directory)
     return {};
 }
 
-// The name is taken when something answers at path; a socket that refuses connections is what a
-// listener that died left behind, and is removed.
-Result<void> removeIfStale(const std::string& path, const sockaddr_un& address)
+// The name is taken when something answers at path. A socket that refuses connections is what a
+// listener that died left behind; it is replaced by the rename in bindListeningSocket.
+Result<void> refuseIfLive(const std::string& path, const sockaddr_un& address)
 {
     struct stat info;
     if (::lstat(path.c_str(), &info) < 0)
@@ -58,30 +59,41 @@ Result<void> removeIfStale(const std::string& path, const sockaddr_un& address)
         return OMError::platform(kPlatformErrorUnsupported, "a live listener already owns " + path);
     if (errno != ECONNREFUSED && errno != ENOENT)
         return OMError::fromErrno("connect " + path, errno);
-    if (::unlink(path.c_str()) < 0 && errno != ENOENT)
-        return OMError::fromErrno("unlink " + path, errno);
     return {};
 }
 
+// The socket is bound and listening under a private name first and then renamed onto the service
+// name, so the name never refers to a socket that refuses connections: a client connecting at
+// any moment either finds no socket or a listening one, and a second daemon probing the name
+// never mistakes a starting listener for a stale one.
 Result<UniqueFd> bindListeningSocket(const std::string& path)
 {
     const sockaddr_un address = OM_TRY(addressOf(path));
+    OM_TRY(refuseIfLive(path, address));
+    // A short name in the same directory: rename stays atomic, and any path that fits the
+    // socket-address limit has room for it.
+    static std::atomic<unsigned> serial { 0 };
+    const std::string directory = path.substr(0, path.rfind('/') + 1);
+    const std::string staging = directory + "." + std::to_string(::getpid()) + "-" + std::to_string(serial++);
+    const sockaddr_un stagingAddress = OM_TRY(addressOf(staging));
     UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     if (!fd.valid())
         return OMError::fromErrno("socket", errno);
-    const auto* raw = reinterpret_cast<const sockaddr*>(&address);
-    if (::bind(fd.get(), raw, sizeof address) < 0) {
-        if (errno != EADDRINUSE)
-            return OMError::fromErrno("bind " + path, errno);
-        OM_TRY(removeIfStale(path, address));
-        if (::bind(fd.get(), raw, sizeof address) < 0)
-            return OMError::fromErrno("bind " + path, errno);
-    }
+    (void)::unlink(staging.c_str());  // left by an earlier process with our pid that died here
+    if (::bind(fd.get(), reinterpret_cast<const sockaddr*>(&stagingAddress), sizeof stagingAddress) < 0)
+        return OMError::fromErrno("bind " + staging, errno);
+    auto fail = [&](const char* call) {
+        const int error = errno;
+        (void)::unlink(staging.c_str());
+        return OMError::fromErrno(std::string(call) + " " + path, error);
+    };
     // Everyone may connect: what a peer may do is decided by its entitlements, not by this mode.
-    if (::chmod(path.c_str(), 0666) < 0)
-        return OMError::fromErrno("chmod " + path, errno);
+    if (::chmod(staging.c_str(), 0666) < 0)
+        return fail("chmod");
     if (::listen(fd.get(), SOMAXCONN) < 0)
-        return OMError::fromErrno("listen " + path, errno);
+        return fail("listen");
+    if (::rename(staging.c_str(), path.c_str()) < 0)
+        return fail("rename");
     return fd;
 }
 

@@ -148,10 +148,17 @@ WorkQueue::~WorkQueue()
 
 void WorkQueue::async(std::function<void()> work)
 {
-    // Notify under the lock: once the item is visible the queue thread may run it, and if it holds
-    // the last reference, destroy this queue before an unlocked notify would touch m_wake.
-    std::lock_guard lock(m_mutex);
+    // Once the item is visible the queue thread may run it, and if the item drops the last
+    // reference this queue could be destroyed before notify touches m_wake. A reference held across
+    // the notify lets it happen after unlocking, so the woken thread does not block on our mutex.
+    auto protect = weak_from_this().lock();
+    std::unique_lock lock(m_mutex);
     m_items.push_back(std::move(work));
+    if (!protect) {
+        m_wake.notify_one();  // not shared (yet): notify under the lock, as nothing can free us
+        return;
+    }
+    lock.unlock();
     m_wake.notify_one();
 }
 
