@@ -1,0 +1,77 @@
+// One connected peer of the daemon's service: who it is (pid, executable, bundle, entitlements)
+// and the receiver of its connection's events, which turns each request into a Transaction.
+//
+// Ownership: the connection holds the record (its context and its event handler); the record
+// refers to the connection only weakly. Transactions in flight hold the record strongly.
+#pragma once
+
+#include <atomic>
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/Conduit.h"
+#include "platform/Value.h"
+
+namespace om {
+
+class CodeSigningTask;
+class OMBundle;
+class OMDServer;
+
+class OMDConduitClient : public std::enable_shared_from_this<OMDConduitClient> {
+public:
+    // Identifies the peer, installs the event handler and resumes the connection. Never fails:
+    // facts that cannot be learned (the executable path, the signing identity) stay absent.
+    static std::shared_ptr<OMDConduitClient> initWithConnection(
+        std::shared_ptr<ConduitConnection> connection, std::shared_ptr<OMDServer> server);
+    ~OMDConduitClient();
+
+    OMDConduitClient(const OMDConduitClient&) = delete;
+    OMDConduitClient& operator=(const OMDConduitClient&) = delete;
+
+    void dying();
+    void dead();
+
+    pid_t pid() const;
+    // None when the entitlement is absent or cannot be read.
+    Value entitlementValueForKey(std::string_view key) const;
+    // Held unless absent, false or numerically zero.
+    bool hasEntitlement(std::string_view key) const;
+    // The rule hasEntitlement applies to an entitlement's value.
+    static bool entitlementHeld(const Value& value);
+    std::string description() const;
+
+    std::shared_ptr<ConduitConnection> connection() const { return m_connection.lock(); }
+    const std::shared_ptr<OMDServer>& server() const { return m_server; }
+    const std::optional<std::string>& path() const { return m_path; }
+    const std::shared_ptr<OMBundle>& bundle() const { return m_bundle; }
+    bool acceptWork() const { return m_acceptWork.load(std::memory_order_relaxed); }
+    uint32_t requestCount() const { return m_requestCount; }
+
+    // The executable path is read into a buffer of this size; a longer path counts as unreadable.
+    static constexpr size_t kExecutablePathBufferSize = 2048;
+
+private:
+    OMDConduitClient(const std::shared_ptr<ConduitConnection>& connection, std::shared_ptr<OMDServer> server);
+    void handleEvent(const ConduitEvent& event);
+    void submitRequest(const ConduitEvent& event);
+
+    std::weak_ptr<ConduitConnection> m_connection;
+    std::shared_ptr<OMDServer> m_server;
+    std::optional<std::string> m_path;
+    std::shared_ptr<OMBundle> m_bundle;
+    // Written on the connection's delivery thread (dead), read on "service" (dispatch). A request
+    // racing with dead is either answered or dropped; both are fine.
+    std::atomic<bool> m_acceptWork { true };
+    // Null when no signing identity could be made: every entitlement then counts as absent.
+    std::shared_ptr<CodeSigningTask> _task;
+    // Touched only on "service"; wraps at 2^32.
+    uint32_t m_requestCount = 0;
+    // The pid as first read; answered once the connection object is gone (nothing relies on it).
+    pid_t m_pid = -1;
+};
+
+} // namespace om

@@ -1,0 +1,67 @@
+// The daemon's one server: the plug-in database plus the queues requests run on, the listening
+// endpoint of the Conduit service and the list of plug-in holds. Made once by main, never destroyed.
+#pragma once
+
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "omd/OMDatabase.h"
+#include "omd/OMDatabaseDelegate.h"
+#include "platform/Conduit.h"
+#include "platform/WorkQueue.h"
+
+namespace om {
+
+class OMDConduitClient;
+class OMDPlugInHold;
+
+class OMDServer final : public OMDatabase, public OMDatabaseDelegate {
+public:
+    static constexpr const char* kDefaultServiceName = "com.orvex.ombrel.omd";
+
+    // None when the database cannot be opened or the service name cannot be listened on (for
+    // instance because another live daemon owns it).
+    static std::shared_ptr<OMDServer> initForService(
+        const std::string& serviceName, std::optional<std::string> databasePath);
+    // The process-wide server, for code that holds no reference to it; null before the first one
+    // is made. Only a weak reference is kept: main owns the server for the life of the process.
+    static std::shared_ptr<OMDServer> server();
+
+    ~OMDServer() override;
+
+    // Resumes the listening endpoint and parks the calling thread for good.
+    [[noreturn]] void run();
+    // The first half of run: from here on connections are accepted. Tests that run a server
+    // in-process call this instead of run.
+    void startListening();
+
+    // Every request's work runs here, one at a time, in submission order.
+    void submitWork(std::function<void()> work);
+
+    void removedPlugIns(const RegistrarPlugInRecords& records) override;
+    // Releases every hold whose client is this very record. Called when its connection dies.
+    void unholdClient(const OMDConduitClient& client);
+
+    const std::shared_ptr<WorkQueue>& conduitQueue() const { return m_conduitQueue; }
+    const std::shared_ptr<WorkQueue>& mainQueue() const { return m_mainQueue; }
+    const std::shared_ptr<WorkQueue>& syncQueue() const { return m_syncQueue; }
+    const std::shared_ptr<ConduitListener>& service() const { return m_service; }
+
+private:
+    explicit OMDServer(std::optional<std::string> databasePath);
+    void acceptConnection(std::shared_ptr<ConduitConnection> connection);
+
+    std::shared_ptr<WorkQueue> m_conduitQueue;
+    std::shared_ptr<WorkQueue> m_mainQueue;
+    std::shared_ptr<ConduitListener> m_service;
+    // The user-preferences object (the user's plug-in exclusions) joins these with the access rules.
+    // Live holds in the order they were granted; touched only on m_syncQueue. Empty until the
+    // "lock" request exists.
+    std::vector<std::shared_ptr<OMDPlugInHold>> m_holds;
+    std::shared_ptr<WorkQueue> m_syncQueue;
+};
+
+} // namespace om

@@ -1,0 +1,83 @@
+// One request from arrival to its one reply. Made on the connection's delivery thread, dispatched
+// on the server's "service" queue, answered by done() or fail() exactly once, from whichever
+// queue the handler finishes on.
+#pragma once
+
+#include <cstdint>
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "platform/Conduit.h"
+#include "platform/OMError.h"
+#include "platform/Value.h"
+
+namespace om {
+
+class OMDConduitClient;
+class OMDServer;
+
+// Protocol versions a request may carry.
+inline constexpr uint64_t kOMProtocolVersionCurrent = 3;
+inline constexpr uint64_t kOMProtocolVersionOldest = 2;
+
+// Typed getters for request dictionaries: the value of key when it has the named kind, else none.
+std::optional<Value> conduit_dictionary_get_array(const Value& dictionary, std::string_view key);
+std::optional<Value> conduit_dictionary_get_dictionary(const Value& dictionary, std::string_view key);
+
+class Transaction : public std::enable_shared_from_this<Transaction> {
+public:
+    // request is the message as received: its id binds the reply to it. A dictionary sent without
+    // awaiting a reply (id 0) is dispatched like any other, so that a fire-and-forget request
+    // still takes effect; done() then has nowhere to send the reply and drops it.
+    Transaction(const ConduitEvent& request, std::shared_ptr<OMDConduitClient> client);
+    ~Transaction();
+
+    Transaction(const Transaction&) = delete;
+    Transaction& operator=(const Transaction&) = delete;
+
+    void dispatch();
+    void done();
+    // message none leaves "error" unset.
+    void fail(int64_t code, std::optional<std::string_view> message);
+    // An error of the daemon's own domain keeps its own code; a foreign one is reported with code.
+    void fail(int64_t code, const OMError& error);
+
+    const std::shared_ptr<OMDConduitClient>& client() const { return m_client; }
+    const Value& request() const { return m_request; }
+    uint64_t requestId() const { return m_requestId; }
+    // The reply being filled; sent by done().
+    DictionaryBuilder& reply() { return m_reply; }
+    uint64_t version() const { return m_version; }
+    void setVersion(uint64_t version) { m_version = version; }
+    bool replied() const { return m_replied; }
+
+    const std::shared_ptr<OMDServer>& server() const;
+    // Null once the peer's connection object is gone.
+    std::shared_ptr<ConduitConnection> connection() const;
+
+private:
+    // Runs the handler named by the request, or answers that there is none (TransactionDispatch.cpp).
+    void runHandler(const std::string& name);
+
+    // Request handlers, one per row of the dispatch table. Each finishes with done() or fail().
+    void addPlugIns();
+    void removePlugIns();
+    void bulkPlugIns();
+    void matchPlugIns();
+    void readyPlugIns();
+    void accessPlugIns();
+    void annotatePlugIns();
+    void bulkAnnotatePlugIns();
+    void lockDownPlugIns();
+
+    std::shared_ptr<OMDConduitClient> m_client;
+    Value m_request;
+    uint64_t m_requestId;
+    DictionaryBuilder m_reply;
+    uint64_t m_version = 0;
+    bool m_replied = false;
+};
+
+} // namespace om

@@ -1,0 +1,75 @@
+// The dispatch table: request names, compared byte for byte and case-sensitively, in this order.
+#include <array>
+#include <string_view>
+
+#include "omd/Transaction.h"
+
+namespace om {
+
+void Transaction::runHandler(const std::string& name)
+{
+    struct Handler {
+        std::string_view name;
+        void (Transaction::*run)();
+    };
+    // Each handler is still a placeholder for now; see the end of this file.
+    static constexpr std::array<Handler, 9> kHandlers { {
+        { "add", &Transaction::addPlugIns },
+        { "remove", &Transaction::removePlugIns },
+        { "bulk", &Transaction::bulkPlugIns },
+        { "match", &Transaction::matchPlugIns },
+        { "ready", &Transaction::readyPlugIns },
+        { "access", &Transaction::accessPlugIns },
+        { "annotate", &Transaction::annotatePlugIns },
+        { "bulk-annotate", &Transaction::bulkAnnotatePlugIns },
+        { "lock", &Transaction::lockDownPlugIns },
+    } };
+
+    for (const auto& handler : kHandlers) {
+        if (handler.name == name)
+            return (this->*handler.run)();
+    }
+    fail(4, "unrecognized request");
+}
+
+// Placeholders. Every row of the table exists from the start so that its name is routed, but each
+// of these handlers still answers as if the name were unknown. Each one is replaced, and its line
+// here deleted, by the change that brings its request.
+void Transaction::addPlugIns()
+{
+    fail(4, "unrecognized request");
+}
+void Transaction::removePlugIns()
+{
+    fail(4, "unrecognized request");
+}
+void Transaction::bulkPlugIns()
+{
+    fail(4, "unrecognized request");
+}
+void Transaction::matchPlugIns()
+{
+    fail(4, "unrecognized request");
+}
+void Transaction::readyPlugIns()
+{
+    fail(4, "unrecognized request");
+}
+void Transaction::accessPlugIns()
+{
+    fail(4, "unrecognized request");
+}
+void Transaction::annotatePlugIns()
+{
+    fail(4, "unrecognized request");
+}
+void Transaction::bulkAnnotatePlugIns()
+{
+    fail(4, "unrecognized request");
+}
+void Transaction::lockDownPlugIns()
+{
+    fail(4, "unrecognized request");
+}
+
+} // namespace om
