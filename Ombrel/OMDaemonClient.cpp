@@ -59,7 +59,9 @@ std::shared_ptr<OMDaemonClient> OMDaemonClient::initWithServiceName(const char* 
 }
 
 OMDaemonClient::OMDaemonClient(std::shared_ptr<WorkQueue> replyQueue, std::shared_ptr<ConduitConnection> omd)
-    : m_replyQueue(std::move(replyQueue)), m_omd(std::move(omd)), m_closing(std::make_shared<std::atomic<bool>>(false))
+    : m_replyQueue(std::move(replyQueue))
+    , m_omd(std::move(omd))
+    , m_closing(std::make_shared<std::atomic<bool>>(false))
 {
 }
 
@@ -140,7 +142,7 @@ void OMDaemonClient::releaseHold(const Uuid& token, ReplyBlock reply)
 {
     // No "flags": the daemon tells a release from a hold by "uuids" being an array.
     auto message = request("lock");
-    set(message, {token});
+    set(message, { token });
     send(message.build(), std::move(reply));
 }
 

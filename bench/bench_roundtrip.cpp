@@ -10,7 +10,6 @@
 // The raw cases also time an echo that answers from one serial work queue, as omd answers from its
 // "service" queue: the floor for any design that hands every request to another thread.
 #include <benchmark/benchmark.h>
-
 #include <fcntl.h>
 #include <signal.h>
 #include <stdlib.h>
@@ -110,10 +109,10 @@ int connectTo(const std::string& path)
 // A request frame for "ping", version 3; the id is patched per request.
 std::vector<uint8_t> pingFrame()
 {
-    auto payload = om::Cbor::encode(om::Value::dictionary({{"request", "ping"}, {"version", 3u}}));
+    auto payload = om::Cbor::encode(om::Value::dictionary({ { "request", "ping" }, { "version", 3u } }));
     uint32_t length = static_cast<uint32_t>(9 + payload.size());
-    std::vector<uint8_t> frame = {static_cast<uint8_t>(length), static_cast<uint8_t>(length >> 8),
-                                  static_cast<uint8_t>(length >> 16), static_cast<uint8_t>(length >> 24), 2};
+    std::vector<uint8_t> frame = { static_cast<uint8_t>(length), static_cast<uint8_t>(length >> 8),
+        static_cast<uint8_t>(length >> 16), static_cast<uint8_t>(length >> 24), 2 };
     frame.resize(kHeaderSize, 0);
     frame.insert(frame.end(), payload.begin(), payload.end());
     return frame;
@@ -130,13 +129,16 @@ void setId(std::vector<uint8_t>& frame, uint64_t id)
 // "service" queue: the difference to the plain echo is what one queue hop costs.
 class EchoServer {
 public:
-    EchoServer(std::string path, std::shared_ptr<om::WorkQueue> hop) : m_path(std::move(path)), m_hop(std::move(hop))
+    EchoServer(std::string path, std::shared_ptr<om::WorkQueue> hop)
+        : m_path(std::move(path))
+        , m_hop(std::move(hop))
     {
         m_listener = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
         sockaddr_un address = {};
         address.sun_family = AF_UNIX;
         std::strncpy(address.sun_path, m_path.c_str(), sizeof address.sun_path - 1);
-        if (::bind(m_listener, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0 || ::listen(m_listener, 64) != 0)
+        if (::bind(m_listener, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0
+            || ::listen(m_listener, 64) != 0)
             std::fprintf(stderr, "echo server: cannot listen at %s: %s\n", m_path.c_str(), std::strerror(errno));
         m_acceptor = std::thread([this] { acceptLoop(); });
     }
@@ -175,7 +177,7 @@ private:
                     hop->async([fd, reply = std::move(frame)] { (void)writeAll(fd, reply.data(), reply.size()); });
                 }
                 if (hop)
-                    hop->sync([] {});  // the last write is done with fd
+                    hop->sync([] {}); // the last write is done with fd
                 ::close(fd);
             });
         }
@@ -225,12 +227,12 @@ public:
             std::string_view name(*entry);
             name = name.substr(0, name.find('='));
             bool ours = std::any_of(settings.begin(), settings.end(),
-                                    [&](const std::string& setting) { return setting.starts_with(std::string(name) + "="); });
+                [&](const std::string& setting) { return setting.starts_with(std::string(name) + "="); });
             if (!ours)
                 settings.emplace_back(*entry);
         }
         std::string binary = daemonBinary();
-        std::vector<std::string> arguments = {binary, "-S", kServiceName};
+        std::vector<std::string> arguments = { binary, "-S", kServiceName };
         std::vector<char*> argv, envp;
         for (auto& argument : arguments)
             argv.push_back(argument.data());
@@ -289,7 +291,7 @@ private:
                 m_pid = -1;
                 return false;
             }
-            timespec pause = {0, 10'000'000};
+            timespec pause = { 0, 10'000'000 };
             ::nanosleep(&pause, nullptr);
         }
         return false;
@@ -301,7 +303,7 @@ private:
 };
 
 struct Batch {
-    std::vector<double> micros;  // one sample per round trip
+    std::vector<double> micros; // one sample per round trip
     double wallSeconds = 0;
     bool failed = false;
 };
@@ -424,7 +426,7 @@ Batch rawBatch(const std::string& path, int threads)
 Batch clientBatch(int threads)
 {
     size_t perThread = kRequestsPerBatch / static_cast<size_t>(threads);
-    om::Value request = om::Value::dictionary({{"request", "ping"}, {"version", 3u}});
+    om::Value request = om::Value::dictionary({ { "request", "ping" }, { "version", 3u } });
     return runBatch(
         threads, perThread,
         [] {
@@ -449,16 +451,17 @@ struct Environment {
         root = ::mkdtemp(pattern.data()) ? pattern : std::string("/tmp");
         ::setenv("CONDUIT_DIR", (root + "/conduit").c_str(), 1);
         echo = std::make_unique<EchoServer>(root + "/echo.sock", nullptr);
-        hopEcho = std::make_unique<EchoServer>(root + "/hop-echo.sock",
-                                               om::WorkQueue::create("echo-hop", om::QualityOfService::UserInitiated));
+        hopEcho = std::make_unique<EchoServer>(
+            root + "/hop-echo.sock", om::WorkQueue::create("echo-hop", om::QualityOfService::UserInitiated));
         daemon = std::make_unique<Daemon>(root);
     }
 
     ~Environment()
     {
         if (!summary.empty()) {
-            std::fprintf(stderr, "\nround trip against the echo baseline (p50, p99: lower is better; "
-                                 "throughput: higher is better)\n");
+            std::fprintf(stderr,
+                "\nround trip against the echo baseline (p50, p99: lower is better; "
+                "throughput: higher is better)\n");
             for (const auto& [name, line] : summary)
                 std::fprintf(stderr, "  %-28s %s\n", name.c_str(), line.c_str());
         }
@@ -490,17 +493,16 @@ void report(benchmark::State& state, const std::string& name, Side& echo, Side& 
 
     char line[512];
     int length = std::snprintf(line, sizeof line,
-                               "p50 %.2fx (%.1f vs %.1f us)  p99 %.2fx (%.1f vs %.1f us)  throughput %.2fx (%.0f vs %.0f/s overall)",
-                               p50 / echoP50, p50, echoP50, p99 / echoP99, p99, echoP99,
-                               throughputRatio(daemon, echo), daemon.throughput(), echo.throughput());
+        "p50 %.2fx (%.1f vs %.1f us)  p99 %.2fx (%.1f vs %.1f us)  throughput %.2fx (%.0f vs %.0f/s overall)",
+        p50 / echoP50, p50, echoP50, p99 / echoP99, p99, echoP99, throughputRatio(daemon, echo), daemon.throughput(),
+        echo.throughput());
     if (hopEcho && length > 0) {
         double hopP50 = hopEcho->percentile(0.50);
         state.counters["hop_echo_p50_us"] = hopP50;
         state.counters["hop_echo_tput_ratio"] = throughputRatio(*hopEcho, echo);
         std::snprintf(line + length, sizeof line - static_cast<size_t>(length),
-                      "\n  %-28s echo with one queue hop: p50 %.2fx (%.1f us)  p99 %.2fx  throughput %.2fx", "",
-                      hopP50 / echoP50, hopP50, hopEcho->percentile(0.99) / echoP99,
-                      throughputRatio(*hopEcho, echo));
+            "\n  %-28s echo with one queue hop: p50 %.2fx (%.1f us)  p99 %.2fx  throughput %.2fx", "", hopP50 / echoP50,
+            hopP50, hopEcho->percentile(0.99) / echoP99, throughputRatio(*hopEcho, echo));
     }
     environment().summary[name] = line;
 }
@@ -531,7 +533,14 @@ void BM_RawRoundTrip(benchmark::State& state)
     state.SetItemsProcessed(static_cast<int64_t>(daemon.micros.size()));
     report(state, "raw frames, " + std::to_string(threads) + " thread(s)", echo, daemon, &hopEcho);
 }
-BENCHMARK(BM_RawRoundTrip)->ArgName("threads")->Arg(1)->Arg(4)->Arg(16)->Iterations(9)->UseManualTime()->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_RawRoundTrip)
+    ->ArgName("threads")
+    ->Arg(1)
+    ->Arg(4)
+    ->Arg(16)
+    ->Iterations(9)
+    ->UseManualTime()
+    ->Unit(benchmark::kMillisecond);
 
 void BM_ClientLibraryRoundTrip(benchmark::State& state)
 {
@@ -557,6 +566,12 @@ void BM_ClientLibraryRoundTrip(benchmark::State& state)
     state.SetItemsProcessed(static_cast<int64_t>(daemon.micros.size()));
     report(state, "OMDaemonClient, " + std::to_string(threads) + " thread(s)", echo, daemon);
 }
-BENCHMARK(BM_ClientLibraryRoundTrip)->ArgName("threads")->Arg(1)->Arg(4)->Iterations(9)->UseManualTime()->Unit(benchmark::kMillisecond);
+BENCHMARK(BM_ClientLibraryRoundTrip)
+    ->ArgName("threads")
+    ->Arg(1)
+    ->Arg(4)
+    ->Iterations(9)
+    ->UseManualTime()
+    ->Unit(benchmark::kMillisecond);
 
 } // namespace

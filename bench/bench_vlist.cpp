@@ -14,7 +14,7 @@ namespace {
 
 std::span<const uint8_t> bytesOf(const std::string& text)
 {
-    return {reinterpret_cast<const uint8_t*>(text.data()), text.size()};
+    return { reinterpret_cast<const uint8_t*>(text.data()), text.size() };
 }
 
 void countBytes(benchmark::State& state, size_t perIteration)

@@ -15,12 +15,12 @@ void checkRoundTrip(const ConduitFrame& frame)
 {
     auto encoded = ConduitFrame::encode(frame.kind, frame.id, frame.payload);
     if (!encoded.ok())
-        std::abort();  // whatever was accepted must be sendable
+        std::abort(); // whatever was accepted must be sendable
     ConduitFrameReader again;
     again.append(encoded.value());
     auto read = again.next();
-    if (!read.ok() || !read.value() || read.value()->kind != frame.kind || read.value()->id != frame.id ||
-        !(read.value()->payload == frame.payload || frame.payload.isNone()))
+    if (!read.ok() || !read.value() || read.value()->kind != frame.kind || read.value()->id != frame.id
+        || !(read.value()->payload == frame.payload || frame.payload.isNone()))
         std::abort();
 }
 
@@ -36,7 +36,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size)
     --size;
     ConduitFrameReader reader;
     for (size_t offset = 0; offset < size; offset += chunk) {
-        reader.append({data + offset, std::min(chunk, size - offset)});
+        reader.append({ data + offset, std::min(chunk, size - offset) });
         for (;;) {
             auto next = reader.next();
             if (!next.ok())

@@ -53,7 +53,8 @@ bool identical(const Value& a, const Value& b)
         if (a.count() != b.count())
             return false;
         for (size_t i = 0; i < a.count(); ++i) {
-            if (a.entries()[i].first != b.entries()[i].first || !identical(a.entries()[i].second, b.entries()[i].second))
+            if (a.entries()[i].first != b.entries()[i].first
+                || !identical(a.entries()[i].second, b.entries()[i].second))
                 return false;
         }
         return true;

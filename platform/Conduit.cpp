@@ -21,8 +21,8 @@ size_t maxPendingFromEnvironment()
     char* end = nullptr;
     const unsigned long long value = std::strtoull(text, &end, 10);
     if (*end != '\0' || value == 0) {
-        ConduitIoThread::log().error("CONDUIT_MAX_PENDING \"%s\" is not a byte count; using %llu", text,
-                                     uint64_t(kDefaultMaxPending));
+        ConduitIoThread::log().error(
+            "CONDUIT_MAX_PENDING \"%s\" is not a byte count; using %llu", text, uint64_t(kDefaultMaxPending));
         return kDefaultMaxPending;
     }
     return size_t(value);
@@ -30,7 +30,7 @@ size_t maxPendingFromEnvironment()
 
 std::atomic<size_t>& maxPendingSetting()
 {
-    static std::atomic<size_t> setting {maxPendingFromEnvironment()};
+    static std::atomic<size_t> setting { maxPendingFromEnvironment() };
     return setting;
 }
 
@@ -52,8 +52,8 @@ std::string Conduit::socketPath(const std::string& serviceName)
 
 bool Conduit::isValidServiceName(const std::string& serviceName)
 {
-    return !serviceName.empty() && serviceName != "." && serviceName != ".." &&
-           serviceName.find('/') == std::string::npos && serviceName.find('\0') == std::string::npos;
+    return !serviceName.empty() && serviceName != "." && serviceName != ".."
+        && serviceName.find('/') == std::string::npos && serviceName.find('\0') == std::string::npos;
 }
 
 size_t Conduit::maxPendingBytes()

@@ -32,15 +32,15 @@ namespace om {
 // Error domain and codes of transport errors (as reply-handler results and events).
 inline constexpr const char* kConduitErrorDomain = "Conduit";
 enum ConduitErrorCode : int64_t {
-    kConduitConnectionInvalid = 1,    // "Connection invalid"
-    kConduitTerminationImminent = 2,  // "Termination imminent"
+    kConduitConnectionInvalid = 1, // "Connection invalid"
+    kConduitTerminationImminent = 2, // "Termination imminent"
 };
 
 struct ConduitEvent {
     enum class Kind : uint8_t { Message, ConnectionInvalid, TerminationImminent };
     Kind kind = Kind::Message;
-    Value message;           // Kind::Message: the decoded item (any kind, not only dictionaries)
-    uint64_t requestId = 0;  // non-zero when the peer awaits a reply (frame kind 2)
+    Value message; // Kind::Message: the decoded item (any kind, not only dictionaries)
+    uint64_t requestId = 0; // non-zero when the peer awaits a reply (frame kind 2)
 
     bool expectsReply() const { return requestId != 0; }
 };
@@ -53,8 +53,8 @@ public:
     // A client connection to a named service. Never fails here: when the service cannot be
     // reached, the connection becomes invalid once resumed, and every request sent on it gets a
     // kConduitConnectionInvalid error. targetQueue null: deliver on the I/O thread.
-    static std::shared_ptr<ConduitConnection> connectToService(const std::string& serviceName,
-                                                               std::shared_ptr<WorkQueue> targetQueue);
+    static std::shared_ptr<ConduitConnection> connectToService(
+        const std::string& serviceName, std::shared_ptr<WorkQueue> targetQueue);
     ~ConduitConnection();
 
     // Set before resume(); later calls are ignored.
@@ -95,7 +95,7 @@ public:
 private:
     friend class ConduitIoThread;
     friend class ConduitListener;
-    ConduitConnection();  // made only by the transport
+    ConduitConnection(); // made only by the transport
     AuditToken m_auditToken;
     struct State;
     std::unique_ptr<State> m_state;
@@ -108,8 +108,8 @@ public:
     // Binds $CONDUIT_DIR/<serviceName> (creating the directory; replacing a stale socket that
     // refuses connections; failing when a live listener owns the name). Suspended until resume().
     // New connections are delivered on queue, not yet resumed.
-    static Result<std::shared_ptr<ConduitListener>> create(const std::string& serviceName,
-                                                           std::shared_ptr<WorkQueue> queue);
+    static Result<std::shared_ptr<ConduitListener>> create(
+        const std::string& serviceName, std::shared_ptr<WorkQueue> queue);
     ~ConduitListener();
 
     void setConnectionHandler(ConnectionHandler handler);

@@ -45,16 +45,16 @@ ConduitConnection::ConduitConnection() = default;
 
 ConduitConnection::~ConduitConnection() = default;
 
-std::shared_ptr<ConduitConnection> ConduitConnection::connectToService(const std::string& serviceName,
-                                                                       std::shared_ptr<WorkQueue> targetQueue)
+std::shared_ptr<ConduitConnection> ConduitConnection::connectToService(
+    const std::string& serviceName, std::shared_ptr<WorkQueue> targetQueue)
 {
     UniqueFd socket;
     AuditToken token;
     if (!Conduit::isValidServiceName(serviceName)) {
         ConduitIoThread::log().error("invalid service name \"%s\"", serviceName);
     } else if (auto connected = connectTo(Conduit::socketPath(serviceName)); !connected.ok()) {
-        ConduitIoThread::log().debug("cannot reach service %s: %s", serviceName,
-                                     connected.error().localizedDescription());
+        ConduitIoThread::log().debug(
+            "cannot reach service %s: %s", serviceName, connected.error().localizedDescription());
     } else {
         socket = std::move(connected).releaseValue();
         if (auto peer = Process::peerOf(socket.get()); peer.ok())
@@ -94,7 +94,8 @@ void ConduitConnection::send(const Value& message)
 
 void ConduitConnection::sendWithReply(const Value& request, std::shared_ptr<WorkQueue> queue, ReplyHandler handler)
 {
-    m_state->write(ConduitFrame::Kind::Request, 0, request, State::PendingReply {std::move(queue), std::move(handler)});
+    m_state->write(
+        ConduitFrame::Kind::Request, 0, request, State::PendingReply { std::move(queue), std::move(handler) });
 }
 
 void ConduitConnection::sendReply(uint64_t requestId, const Value& reply)

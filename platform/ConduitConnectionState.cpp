@@ -34,8 +34,8 @@ ssize_t sendSome(int fd, const uint8_t* bytes, size_t size)
 
 } // namespace
 
-std::shared_ptr<ConduitConnection> ConduitConnection::State::make(Role role, UniqueFd socket, AuditToken token,
-                                                                  std::string name)
+std::shared_ptr<ConduitConnection> ConduitConnection::State::make(
+    Role role, UniqueFd socket, AuditToken token, std::string name)
 {
     std::shared_ptr<ConduitConnection> connection(new ConduitConnection());
     connection->m_auditToken = std::move(token);
@@ -44,7 +44,10 @@ std::shared_ptr<ConduitConnection> ConduitConnection::State::make(Role role, Uni
 }
 
 ConduitConnection::State::State(ConduitConnection& owner, Role role, UniqueFd socket, std::string name)
-    : m_role(role), m_name(std::move(name)), m_owner(owner), m_socket(std::move(socket))
+    : m_role(role)
+    , m_name(std::move(name))
+    , m_owner(owner)
+    , m_socket(std::move(socket))
 {
     if (!m_socket.valid())
         m_closed = m_invalid = true;
@@ -105,8 +108,8 @@ void ConduitConnection::State::cancel()
     ConduitIoThread::shared().post([self = m_owner.shared_from_this()] { self->m_state->closeNow(std::nullopt); });
 }
 
-void ConduitConnection::State::write(ConduitFrame::Kind kind, uint64_t replyTo, const Value& payload,
-                                     std::optional<PendingReply> reply)
+void ConduitConnection::State::write(
+    ConduitFrame::Kind kind, uint64_t replyTo, const Value& payload, std::optional<PendingReply> reply)
 {
     auto frame = ConduitFrame::encode(kind, replyTo, payload);
     if (!frame.ok()) {
@@ -114,7 +117,7 @@ void ConduitConnection::State::write(ConduitFrame::Kind kind, uint64_t replyTo, 
         if (reply)
             completeLater(std::move(*reply), frame.error());
         else if (kind == ConduitFrame::Kind::Reply)
-            cancel();  // the peer waits for this reply: better it learns now that none will come
+            cancel(); // the peer waits for this reply: better it learns now that none will come
         return;
     }
 
@@ -145,7 +148,7 @@ void ConduitConnection::State::enqueueLocked(std::vector<uint8_t> frame)
     if (m_outbound.empty() && m_socket.valid()) {
         const ssize_t written = sendSome(m_socket.get(), frame.data(), frame.size());
         if (written < 0)
-            return;  // the peer is gone; reading will see the end of the stream
+            return; // the peer is gone; reading will see the end of the stream
         offset = size_t(written);
         if (offset == frame.size())
             return;
@@ -181,14 +184,14 @@ void ConduitConnection::State::flush()
         auto& front = m_outbound.front();
         const ssize_t written = sendSome(m_socket.get(), front.data() + m_frontOffset, front.size() - m_frontOffset);
         if (written < 0) {
-            m_outbound.clear();  // the peer is gone; reading will see the end of the stream
+            m_outbound.clear(); // the peer is gone; reading will see the end of the stream
             m_outboundBytes = 0;
             break;
         }
         m_frontOffset += size_t(written);
         m_outboundBytes -= size_t(written);
         if (m_frontOffset < front.size())
-            return;  // EAGAIN: stay armed
+            return; // EAGAIN: stay armed
         m_outbound.pop_front();
         m_frontOffset = 0;
     }
@@ -208,13 +211,13 @@ void ConduitConnection::State::handleEvents(uint32_t events)
 
 void ConduitConnection::State::readAvailable()
 {
-    static uint8_t chunk[kReadChunk];  // the I/O thread is the only reader
+    static uint8_t chunk[kReadChunk]; // the I/O thread is the only reader
     size_t budget = kReadBudget;
     while (budget > 0 && m_socket.valid()) {
         const ssize_t count = ::recv(m_socket.get(), chunk, sizeof chunk, MSG_DONTWAIT);
         if (count > 0) {
             budget -= std::min(budget, size_t(count));
-            m_reader.append({chunk, size_t(count)});
+            m_reader.append({ chunk, size_t(count) });
             if (!drainFrames())
                 return;
             // A short read emptied the socket; epoll is level-triggered, so anything arriving
@@ -256,10 +259,10 @@ bool ConduitConnection::State::handleFrame(ConduitFrame frame)
     switch (frame.kind) {
     case ConduitFrame::Kind::Message:
     case ConduitFrame::Kind::Request:
-        deliver(ConduitEvent {ConduitEvent::Kind::Message, std::move(frame.payload), frame.id});
+        deliver(ConduitEvent { ConduitEvent::Kind::Message, std::move(frame.payload), frame.id });
         return true;
     case ConduitFrame::Kind::TerminationImminent:
-        deliver(ConduitEvent {ConduitEvent::Kind::TerminationImminent, Value(), 0});
+        deliver(ConduitEvent { ConduitEvent::Kind::TerminationImminent, Value(), 0 });
         return true;
     case ConduitFrame::Kind::Reply:
         break;
@@ -273,8 +276,8 @@ bool ConduitConnection::State::handleFrame(ConduitFrame frame)
         }
     }
     if (!reply) {
-        closeNow(OMError::platform(kPlatformErrorMalformed,
-                                   "reply to request " + std::to_string(frame.id) + ", which is not outstanding"));
+        closeNow(OMError::platform(
+            kPlatformErrorMalformed, "reply to request " + std::to_string(frame.id) + ", which is not outstanding"));
         return false;
     }
     completeNow(std::move(*reply), std::move(frame.payload));
@@ -299,8 +302,8 @@ void ConduitConnection::State::closeNow(std::optional<OMError> protocolError)
         m_reader = ConduitFrameReader();
     }
     if (protocolError)
-        ConduitIoThread::log().error("protocol error on connection to pid %d: %s; closing it", peerPid(),
-                                     protocolError->localizedDescription());
+        ConduitIoThread::log().error(
+            "protocol error on connection to pid %d: %s; closing it", peerPid(), protocolError->localizedDescription());
     else
         ConduitIoThread::log().debug("connection to pid %d closed", peerPid());
     for (auto& [id, reply] : pending)
@@ -314,14 +317,15 @@ void ConduitConnection::State::deliverInvalid()
     if (m_invalidDelivered)
         return;
     m_invalidDelivered = true;
-    deliver(ConduitEvent {ConduitEvent::Kind::ConnectionInvalid, Value(), 0});
+    deliver(ConduitEvent { ConduitEvent::Kind::ConnectionInvalid, Value(), 0 });
 }
 
 void ConduitConnection::State::deliver(ConduitEvent event)
 {
     if (!m_targetQueue)
         return dispatch(event);
-    m_targetQueue->async([self = m_owner.shared_from_this(), event = std::move(event)] { self->m_state->dispatch(event); });
+    m_targetQueue->async(
+        [self = m_owner.shared_from_this(), event = std::move(event)] { self->m_state->dispatch(event); });
 }
 
 // Serial per connection: the target queue, or the I/O thread.
@@ -354,9 +358,8 @@ void ConduitConnection::State::completeLater(PendingReply reply, Result<Value> r
 {
     if (!reply.handler)
         return;
-    auto work = [handler = std::move(reply.handler), result = std::move(result)]() mutable {
-        handler(std::move(result));
-    };
+    auto work
+        = [handler = std::move(reply.handler), result = std::move(result)]() mutable { handler(std::move(result)); };
     if (reply.queue)
         reply.queue->async(std::move(work));
     else

@@ -27,7 +27,7 @@ struct ConduitConnection::State final : ConduitIoThread::Source {
     enum class Role : uint8_t { Client, Peer };
 
     struct PendingReply {
-        std::shared_ptr<WorkQueue> queue;  // null: the I/O thread
+        std::shared_ptr<WorkQueue> queue; // null: the I/O thread
         ReplyHandler handler;
     };
 
@@ -45,12 +45,12 @@ struct ConduitConnection::State final : ConduitIoThread::Source {
     std::string describe() const;
 
     const Role m_role;
-    const std::string m_name;  // the service name of a client connection; empty for peers
+    const std::string m_name; // the service name of a client connection; empty for peers
 
     // Set before resume(), read only by delivery afterwards.
     EventHandler m_handler;
     std::shared_ptr<WorkQueue> m_targetQueue;
-    std::atomic<bool> m_resumed {false};
+    std::atomic<bool> m_resumed { false };
 
     mutable std::mutex m_mutex;
     std::shared_ptr<void> m_context;
@@ -78,14 +78,14 @@ private:
     // Guarded by m_mutex. The socket is written (closed) only on the I/O thread, under the mutex,
     // so the I/O thread may read it without the mutex.
     UniqueFd m_socket;
-    bool m_closed = false;   // the socket is gone
-    bool m_invalid = false;  // no more output is accepted (closed, cancelled or over budget)
+    bool m_closed = false; // the socket is gone
+    bool m_invalid = false; // no more output is accepted (closed, cancelled or over budget)
     uint64_t m_lastRequestId = 0;
     std::unordered_map<uint64_t, PendingReply> m_pending;
     std::deque<std::vector<uint8_t>> m_outbound;
-    size_t m_frontOffset = 0;    // bytes of m_outbound.front() already written
-    size_t m_outboundBytes = 0;  // unwritten bytes in m_outbound
-    uint64_t m_ioKey = 0;        // registration with the I/O thread; 0 when not registered
+    size_t m_frontOffset = 0; // bytes of m_outbound.front() already written
+    size_t m_outboundBytes = 0; // unwritten bytes in m_outbound
+    uint64_t m_ioKey = 0; // registration with the I/O thread; 0 when not registered
     bool m_writeArmed = false;
 
     // I/O thread only.

@@ -47,7 +47,7 @@ std::optional<std::string> checkCarriable(const Value& value, unsigned depth)
         return std::string("a none value");
     case Value::Type::String: {
         const auto& text = *value.asString();
-        if (CborDecoder::invalidUtf8Offset({reinterpret_cast<const uint8_t*>(text.data()), text.size()}))
+        if (CborDecoder::invalidUtf8Offset({ reinterpret_cast<const uint8_t*>(text.data()), text.size() }))
             return std::string("text that is not UTF-8");
         return std::nullopt;
     }
@@ -64,7 +64,7 @@ std::optional<std::string> checkCarriable(const Value& value, unsigned depth)
             return problem;
     }
     for (const auto& [key, element] : value.entries()) {
-        if (CborDecoder::invalidUtf8Offset({reinterpret_cast<const uint8_t*>(key.data()), key.size()}))
+        if (CborDecoder::invalidUtf8Offset({ reinterpret_cast<const uint8_t*>(key.data()), key.size() }))
             return std::string("a key that is not UTF-8");
         if (auto problem = checkCarriable(element, depth + 1))
             return problem;
@@ -89,8 +89,8 @@ Result<std::vector<uint8_t>> ConduitFrame::encode(Kind kind, uint64_t id, const 
     }
     const size_t payloadSize = frame.size() - kHeaderSize;
     if (payloadSize > Conduit::kMaxPayload)
-        return OMError::platform(kPlatformErrorLimit, "message of " + std::to_string(payloadSize) +
-                                                          " bytes exceeds the frame limit");
+        return OMError::platform(
+            kPlatformErrorLimit, "message of " + std::to_string(payloadSize) + " bytes exceeds the frame limit");
     writeLe(frame.data(), kMinLength + payloadSize, kLengthSize);
     frame[kKindOffset] = uint8_t(kind);
     writeLe(frame.data() + kIdOffset, id, 8);
@@ -138,7 +138,8 @@ std::optional<OMError> ConduitFrameReader::checkHeader() const
     if (frameKind == ConduitFrame::Kind::TerminationImminent && length != ConduitFrame::kMinLength)
         return OMError::platform(kPlatformErrorMalformed, "termination frame with a payload");
     if (frameKind != ConduitFrame::Kind::TerminationImminent && length == ConduitFrame::kMinLength)
-        return OMError::platform(kPlatformErrorMalformed, "frame of kind " + std::to_string(kind) + " without a payload");
+        return OMError::platform(
+            kPlatformErrorMalformed, "frame of kind " + std::to_string(kind) + " without a payload");
     if (available < ConduitFrame::kHeaderSize)
         return std::nullopt;
     const uint64_t id = readLe64(header + kIdOffset);
@@ -147,16 +148,16 @@ std::optional<OMError> ConduitFrameReader::checkHeader() const
         if (id == 0)
             return OMError::platform(kPlatformErrorMalformed, "request with id 0");
         if (id <= m_lastRequestId)
-            return OMError::platform(kPlatformErrorMalformed, "request id " + std::to_string(id) +
-                                                                  " not above " + std::to_string(m_lastRequestId));
+            return OMError::platform(kPlatformErrorMalformed,
+                "request id " + std::to_string(id) + " not above " + std::to_string(m_lastRequestId));
         break;
     case ConduitFrame::Kind::Reply:
-        break;  // whether it answers anything is the connection's to say
+        break; // whether it answers anything is the connection's to say
     case ConduitFrame::Kind::Message:
     case ConduitFrame::Kind::TerminationImminent:
         if (id != 0)
-            return OMError::platform(kPlatformErrorMalformed, "frame of kind " + std::to_string(kind) +
-                                                                  " with id " + std::to_string(id));
+            return OMError::platform(
+                kPlatformErrorMalformed, "frame of kind " + std::to_string(kind) + " with id " + std::to_string(id));
         break;
     }
     return std::nullopt;
@@ -197,11 +198,11 @@ std::optional<OMError> ConduitFrameReader::finish() const
     if (m_error || buffered() == 0)
         return std::nullopt;
     if (buffered() < ConduitFrame::kHeaderSize)
-        return OMError::platform(kPlatformErrorMalformed, "stream ended inside a frame header (" +
-                                                              std::to_string(buffered()) + " bytes)");
-    return OMError::platform(kPlatformErrorMalformed, "stream ended inside a frame (" + std::to_string(buffered()) +
-                                                          " of " + std::to_string(kLengthSize + readLe32(m_buffer.data() + m_offset)) +
-                                                          " bytes)");
+        return OMError::platform(
+            kPlatformErrorMalformed, "stream ended inside a frame header (" + std::to_string(buffered()) + " bytes)");
+    return OMError::platform(kPlatformErrorMalformed,
+        "stream ended inside a frame (" + std::to_string(buffered()) + " of "
+            + std::to_string(kLengthSize + readLe32(m_buffer.data() + m_offset)) + " bytes)");
 }
 
 OMError ConduitFrameReader::fail(std::string what)

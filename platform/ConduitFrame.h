@@ -27,7 +27,7 @@ struct ConduitFrame {
 
     Kind kind = Kind::Message;
     uint64_t id = 0;
-    Value payload;  // none for TerminationImminent
+    Value payload; // none for TerminationImminent
 
     // Header plus the CBOR encoding of payload (nothing for TerminationImminent). Fails when the
     // payload cannot travel: none inside, nesting deeper than the decoder accepts, or too large.
@@ -59,8 +59,8 @@ private:
     OMError fail(std::string what);
 
     std::vector<uint8_t> m_buffer;
-    size_t m_offset = 0;           // start of the first unconsumed frame in m_buffer
-    uint64_t m_lastRequestId = 0;  // request ids must increase per connection
+    size_t m_offset = 0; // start of the first unconsumed frame in m_buffer
+    uint64_t m_lastRequestId = 0; // request ids must increase per connection
     std::optional<OMError> m_error;
 };
 

@@ -33,7 +33,8 @@ int fdOfKey(uint64_t key)
 class TerminationSignal final : public ConduitIoThread::Source {
 public:
     TerminationSignal(UniqueFd fd, std::function<void()> onTerminate)
-        : m_fd(std::move(fd)), m_onTerminate(std::move(onTerminate))
+        : m_fd(std::move(fd))
+        , m_onTerminate(std::move(onTerminate))
     {
     }
     void handleEvents(uint32_t) override
@@ -54,8 +55,8 @@ private:
 
 } // namespace
 
-std::atomic<int64_t> ConduitIoThread::s_keepAlives {0};
-std::atomic<bool> ConduitIoThread::s_terminating {false};
+std::atomic<int64_t> ConduitIoThread::s_keepAlives { 0 };
+std::atomic<bool> ConduitIoThread::s_terminating { false };
 
 ConduitIoThread& ConduitIoThread::shared()
 {
@@ -75,10 +76,12 @@ const Log& ConduitIoThread::log()
 }
 
 ConduitIoThread::ConduitIoThread()
-    : m_epoll(::epoll_create1(EPOLL_CLOEXEC)), m_wake(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK))
+    : m_epoll(::epoll_create1(EPOLL_CLOEXEC))
+    , m_wake(::eventfd(0, EFD_CLOEXEC | EFD_NONBLOCK))
 {
     if (!m_epoll.valid() || !m_wake.valid())
-        internalInconsistency(std::string("conduit I/O thread: cannot create epoll or eventfd: ") + std::strerror(errno));
+        internalInconsistency(
+            std::string("conduit I/O thread: cannot create epoll or eventfd: ") + std::strerror(errno));
     epoll_event event {};
     event.events = EPOLLIN;
     event.data.u64 = kWakeKey;
@@ -121,7 +124,7 @@ void ConduitIoThread::run(std::function<void()> work)
 uint64_t ConduitIoThread::add(int fd, uint32_t events, std::shared_ptr<Source> source)
 {
     if (++m_generation == 0)
-        m_generation = 1;  // key 0 is the wake eventfd's
+        m_generation = 1; // key 0 is the wake eventfd's
     const uint64_t key = makeKey(m_generation, fd);
     epoll_event event {};
     event.events = events;
@@ -130,7 +133,7 @@ uint64_t ConduitIoThread::add(int fd, uint32_t events, std::shared_ptr<Source> s
         log().error("epoll_ctl(ADD) of descriptor %d: %s", fd, std::strerror(errno));
         return 0;
     }
-    m_sources[fd] = Registration {key, std::move(source)};
+    m_sources[fd] = Registration { key, std::move(source) };
     return key;
 }
 
@@ -139,7 +142,7 @@ void ConduitIoThread::remove(int fd, uint64_t key)
     auto found = m_sources.find(fd);
     if (found == m_sources.end() || found->second.key != key)
         return;
-    (void)::epoll_ctl(m_epoll.get(), EPOLL_CTL_DEL, fd, nullptr);  // fails only for a closed fd
+    (void)::epoll_ctl(m_epoll.get(), EPOLL_CTL_DEL, fd, nullptr); // fails only for a closed fd
     // The caller keeps its source alive while it runs; this may still be the registry's last
     // reference for sources removed from posted work.
     auto source = std::move(found->second.source);
@@ -169,13 +172,13 @@ void ConduitIoThread::loop()
         for (int i = 0; i < count; ++i) {
             const uint64_t key = events[i].data.u64;
             if (key == kWakeKey) {
-                woken = true;  // runPosted() below drains it
+                woken = true; // runPosted() below drains it
                 continue;
             }
             auto found = m_sources.find(fdOfKey(key));
             if (found == m_sources.end() || found->second.key != key)
-                continue;  // removed (and perhaps reused) earlier in this round
-            auto source = found->second.source;  // a handler may remove its own registration
+                continue; // removed (and perhaps reused) earlier in this round
+            auto source = found->second.source; // a handler may remove its own registration
             source->handleEvents(events[i].events);
         }
         // Posted work always writes the eventfd (see post()), so a round without the wake event

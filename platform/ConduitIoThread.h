@@ -78,7 +78,7 @@ private:
     };
 
     UniqueFd m_epoll;
-    UniqueFd m_wake;  // eventfd
+    UniqueFd m_wake; // eventfd
     std::thread::id m_threadId;
 
     // I/O thread only.

@@ -1,9 +1,9 @@
-#include <atomic>
 #include <fcntl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
 
+#include <atomic>
 #include <cerrno>
 #include <cstring>
 
@@ -79,7 +79,7 @@ Result<UniqueFd> bindListeningSocket(const std::string& path)
     UniqueFd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
     if (!fd.valid())
         return OMError::fromErrno("socket", errno);
-    (void)::unlink(staging.c_str());  // left by an earlier process with our pid that died here
+    (void)::unlink(staging.c_str()); // left by an earlier process with our pid that died here
     if (::bind(fd.get(), reinterpret_cast<const sockaddr*>(&stagingAddress), sizeof stagingAddress) < 0)
         return OMError::fromErrno("bind " + staging, errno);
     auto fail = [&](const char* call) {
@@ -112,7 +112,9 @@ struct ConduitListener::State {
     };
 
     State(std::string socketPath, UniqueFd socket, std::shared_ptr<WorkQueue> deliveryQueue)
-        : path(std::move(socketPath)), queue(std::move(deliveryQueue)), socket(std::make_shared<UniqueFd>(std::move(socket)))
+        : path(std::move(socketPath))
+        , queue(std::move(deliveryQueue))
+        , socket(std::make_shared<UniqueFd>(std::move(socket)))
     {
         struct stat info;
         if (::stat(path.c_str(), &info) == 0) {
@@ -127,15 +129,15 @@ struct ConduitListener::State {
     void shutdown();
 
     const std::string path;
-    const std::shared_ptr<WorkQueue> queue;  // null: the I/O thread
-    ConnectionHandler handler;               // set before resume()
-    std::atomic<bool> resumed {false};
-    std::atomic<bool> cancelled {false};
+    const std::shared_ptr<WorkQueue> queue; // null: the I/O thread
+    ConnectionHandler handler; // set before resume()
+    std::atomic<bool> resumed { false };
+    std::atomic<bool> cancelled { false };
 
     std::mutex mutex;
-    std::shared_ptr<UniqueFd> socket;  // shared with the I/O thread's cleanup
+    std::shared_ptr<UniqueFd> socket; // shared with the I/O thread's cleanup
     uint64_t ioKey = 0;
-    dev_t device = 0;  // identity of the socket file we bound, so that we unlink only our own
+    dev_t device = 0; // identity of the socket file we bound, so that we unlink only our own
     ino_t inode = 0;
 };
 
@@ -157,7 +159,7 @@ void ConduitListener::State::acceptPending(ConduitListener& owner)
     std::shared_ptr<UniqueFd> listening;
     {
         std::lock_guard lock(mutex);
-        listening = socket;  // shutdown() may swap it out from another thread
+        listening = socket; // shutdown() may swap it out from another thread
     }
     if (!listening->valid())
         return;
@@ -179,19 +181,19 @@ void ConduitListener::State::acceptPending(ConduitListener& owner)
         }
         auto token = Process::peerOf(peer.get());
         if (!token.ok()) {
-            ConduitIoThread::log().error("new connection on %s: %s; closing it", path,
-                                         token.error().localizedDescription());
+            ConduitIoThread::log().error(
+                "new connection on %s: %s; closing it", path, token.error().localizedDescription());
             continue;
         }
-        auto connection = ConduitConnection::State::make(ConduitConnection::State::Role::Peer, std::move(peer),
-                                                         std::move(token).releaseValue(), std::string());
+        auto connection = ConduitConnection::State::make(
+            ConduitConnection::State::Role::Peer, std::move(peer), std::move(token).releaseValue(), std::string());
         ConduitIoThread::shared().addPeer(connection);
         deliver(owner.shared_from_this(), std::move(connection));
     }
 }
 
-void ConduitListener::State::deliver(const std::shared_ptr<ConduitListener>& owner,
-                                     std::shared_ptr<ConduitConnection> connection)
+void ConduitListener::State::deliver(
+    const std::shared_ptr<ConduitListener>& owner, std::shared_ptr<ConduitConnection> connection)
 {
     auto hand = [owner, connection = std::move(connection)] {
         auto& state = *owner->m_state;
@@ -219,9 +221,9 @@ void ConduitListener::State::shutdown()
     }
     struct stat info;
     if (::stat(path.c_str(), &info) == 0 && info.st_dev == device && info.st_ino == inode)
-        (void)::unlink(path.c_str());  // a successor may already have replaced it: that is fine
+        (void)::unlink(path.c_str()); // a successor may already have replaced it: that is fine
     if (key == 0)
-        return;  // never registered: closing drops the descriptor here
+        return; // never registered: closing drops the descriptor here
     // A registered descriptor is closed on the I/O thread, after its registration is gone, so
     // that no event of a reused descriptor number can reach a stale registration.
     ConduitIoThread::shared().run([closing, key] { ConduitIoThread::shared().remove(closing->get(), key); });
@@ -234,8 +236,8 @@ ConduitListener::~ConduitListener()
     m_state->shutdown();
 }
 
-Result<std::shared_ptr<ConduitListener>> ConduitListener::create(const std::string& serviceName,
-                                                                 std::shared_ptr<WorkQueue> queue)
+Result<std::shared_ptr<ConduitListener>> ConduitListener::create(
+    const std::string& serviceName, std::shared_ptr<WorkQueue> queue)
 {
     if (!Conduit::isValidServiceName(serviceName))
         return OMError::platform(kPlatformErrorUnsupported, "invalid service name \"" + serviceName + "\"");

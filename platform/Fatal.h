@@ -10,8 +10,8 @@ namespace om {
 
 } // namespace om
 
-#define OM_ASSERT(condition)                                                                       \
-    do {                                                                                           \
-        if (!(condition)) [[unlikely]]                                                             \
-            ::om::internalInconsistency("assertion failed: " #condition);                          \
+#define OM_ASSERT(condition)                                                                                           \
+    do {                                                                                                               \
+        if (!(condition)) [[unlikely]]                                                                                 \
+            ::om::internalInconsistency("assertion failed: " #condition);                                              \
     } while (0)

@@ -20,21 +20,47 @@ public:
     enum class Kind : uint8_t { Signed, Unsigned, Text, Object, Pointer };
 
     template <typename I>
-        requires(std::is_integral_v<I> && std::is_signed_v<I>)
-    FormatArg(I v) : m_kind(Kind::Signed), m_signed(v)
+    requires(std::is_integral_v<I>&& std::is_signed_v<I>) FormatArg(I v)
+        : m_kind(Kind::Signed)
+        , m_signed(v)
     {
     }
     template <typename I>
-        requires(std::is_integral_v<I> && std::is_unsigned_v<I> && !std::is_same_v<I, bool>)
-    FormatArg(I v) : m_kind(Kind::Unsigned), m_unsigned(v)
+    requires(std::is_integral_v<I>&& std::is_unsigned_v<I> && !std::is_same_v<I, bool>) FormatArg(I v)
+        : m_kind(Kind::Unsigned)
+        , m_unsigned(v)
     {
     }
-    FormatArg(bool v) : m_kind(Kind::Signed), m_signed(v ? 1 : 0) {}
-    FormatArg(const char* text) : m_kind(Kind::Text), m_text(text ? text : "(null)") {}
-    FormatArg(const std::string& text) : m_kind(Kind::Text), m_text(text) {}
-    FormatArg(std::string_view text) : m_kind(Kind::Text), m_text(text) {}
-    FormatArg(const Value& value) : m_kind(Kind::Object), m_value(&value) {}
-    FormatArg(const void* pointer) : m_kind(Kind::Pointer), m_pointer(pointer) {}
+    FormatArg(bool v)
+        : m_kind(Kind::Signed)
+        , m_signed(v ? 1 : 0)
+    {
+    }
+    FormatArg(const char* text)
+        : m_kind(Kind::Text)
+        , m_text(text ? text : "(null)")
+    {
+    }
+    FormatArg(const std::string& text)
+        : m_kind(Kind::Text)
+        , m_text(text)
+    {
+    }
+    FormatArg(std::string_view text)
+        : m_kind(Kind::Text)
+        , m_text(text)
+    {
+    }
+    FormatArg(const Value& value)
+        : m_kind(Kind::Object)
+        , m_value(&value)
+    {
+    }
+    FormatArg(const void* pointer)
+        : m_kind(Kind::Pointer)
+        , m_pointer(pointer)
+    {
+    }
 
     Kind kind() const { return m_kind; }
     int64_t signedValue() const { return m_signed; }
@@ -56,7 +82,7 @@ std::string formatString(std::string_view format, std::initializer_list<FormatAr
 
 template <typename... Args> std::string format(std::string_view fmt, const Args&... args)
 {
-    return formatString(fmt, {FormatArg(args)...});
+    return formatString(fmt, { FormatArg(args)... });
 }
 
 } // namespace om

@@ -70,11 +70,10 @@ public:
         std::vector<Record> records() const;
         size_t count(std::string_view message) const;
         // Blocks until a record with exactly this message exists or the timeout passes.
-        bool waitFor(std::string_view message,
-                     std::chrono::milliseconds timeout = std::chrono::seconds(30)) const;
+        bool waitFor(std::string_view message, std::chrono::milliseconds timeout = std::chrono::seconds(30)) const;
         // Blocks until predicate holds over the records or the timeout passes.
         bool waitUntil(const std::function<bool(const std::vector<Record>&)>& predicate,
-                       std::chrono::milliseconds timeout = std::chrono::seconds(30)) const;
+            std::chrono::milliseconds timeout = std::chrono::seconds(30)) const;
         void clear();
 
     private:

@@ -12,7 +12,9 @@ namespace om {
 class OMError {
 public:
     OMError(std::string domain, int64_t code, std::optional<std::string> description = std::nullopt)
-        : m_domain(std::move(domain)), m_code(code), m_description(std::move(description))
+        : m_domain(std::move(domain))
+        , m_code(code)
+        , m_description(std::move(description))
     {
     }
 
@@ -38,8 +40,8 @@ private:
 
 // Codes of the "Platform" domain.
 enum PlatformErrorCode : int64_t {
-    kPlatformErrorMalformed = 1,  // bytes that do not decode (CBOR, vlist, UUID text)
-    kPlatformErrorLimit = 2,      // a size or depth limit was exceeded
+    kPlatformErrorMalformed = 1, // bytes that do not decode (CBOR, vlist, UUID text)
+    kPlatformErrorLimit = 2, // a size or depth limit was exceeded
     kPlatformErrorUnsupported = 3,
 };
 

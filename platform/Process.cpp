@@ -44,7 +44,7 @@ bool stillRunning(const AuditToken& token)
         struct stat info;
         return ::stat(procPath(token.pid, "").c_str(), &info) == 0;
     }
-    pollfd entry {token.pidfd->get(), POLLIN, 0};
+    pollfd entry { token.pidfd->get(), POLLIN, 0 };
     int result;
     do {
         result = ::poll(&entry, 1, 0);
@@ -66,9 +66,10 @@ struct NamespaceIds {
 NamespaceIds namespacesOf(const std::string& procDirectory)
 {
     struct stat user, mount;
-    if (::stat((procDirectory + "ns/user").c_str(), &user) < 0 || ::stat((procDirectory + "ns/mnt").c_str(), &mount) < 0)
+    if (::stat((procDirectory + "ns/user").c_str(), &user) < 0
+        || ::stat((procDirectory + "ns/mnt").c_str(), &mount) < 0)
         return {};
-    return {true, user.st_dev, mount.st_dev, user.st_ino, mount.st_ino};
+    return { true, user.st_dev, mount.st_dev, user.st_ino, mount.st_ino };
 }
 
 struct SeccompState {
@@ -105,7 +106,7 @@ Result<AuditToken> Process::peerOf(int socketFd)
     if (credentials.pid <= 0)
         return OMError::platform(kPlatformErrorUnsupported, "peer has no process id");
 
-    AuditToken token {credentials.pid, credentials.uid, credentials.gid, nullptr};
+    AuditToken token { credentials.pid, credentials.uid, credentials.gid, nullptr };
     int pidfd = -1;
     length = sizeof pidfd;
     if (::getsockopt(socketFd, SOL_SOCKET, SO_PEERPIDFD, &pidfd, &length) == 0 && pidfd >= 0) {
@@ -172,8 +173,8 @@ bool Process::isSandboxed(const AuditToken& token)
     if (!stillRunning(token) || !theirs.known || !theirFilter.known)
         return true;
     const NamespaceIds ours = namespacesOf("/proc/self/");
-    if (theirs.userDevice != ours.userDevice || theirs.userInode != ours.userInode ||
-        theirs.mountDevice != ours.mountDevice || theirs.mountInode != ours.mountInode)
+    if (theirs.userDevice != ours.userDevice || theirs.userInode != ours.userInode
+        || theirs.mountDevice != ours.mountDevice || theirs.mountInode != ours.mountInode)
         return true;
     // A filter the whole system runs under (a container's, or one our own unit inherited) is not a
     // sandbox of this process: only a filter beyond ours is.

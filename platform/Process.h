@@ -21,7 +21,7 @@ struct AuditToken {
     pid_t pid = -1;
     uid_t uid = static_cast<uid_t>(-1);
     gid_t gid = static_cast<gid_t>(-1);
-    std::shared_ptr<const UniqueFd> pidfd;  // may be empty when the kernel gave none
+    std::shared_ptr<const UniqueFd> pidfd; // may be empty when the kernel gave none
 };
 
 class Process {

@@ -12,8 +12,14 @@ namespace om {
 
 template <typename T> class [[nodiscard]] Result {
 public:
-    Result(T value) : m_storage(std::in_place_index<0>, std::move(value)) {}
-    Result(OMError error) : m_storage(std::in_place_index<1>, std::move(error)) {}
+    Result(T value)
+        : m_storage(std::in_place_index<0>, std::move(value))
+    {
+    }
+    Result(OMError error)
+        : m_storage(std::in_place_index<1>, std::move(error))
+    {
+    }
 
     bool ok() const { return m_storage.index() == 0; }
     explicit operator bool() const { return ok(); }
@@ -51,7 +57,10 @@ private:
 template <> class [[nodiscard]] Result<void> {
 public:
     Result() = default;
-    Result(OMError error) : m_error(std::move(error)) {}
+    Result(OMError error)
+        : m_error(std::move(error))
+    {
+    }
 
     bool ok() const { return !m_error.has_value(); }
     explicit operator bool() const { return ok(); }
@@ -60,7 +69,7 @@ public:
         assert(!ok());
         return *m_error;
     }
-    void releaseValue() && {}
+    void releaseValue() && { }
 
 private:
     std::optional<OMError> m_error;
@@ -70,10 +79,10 @@ private:
 
 // Propagates the error of a Result-returning expression; otherwise yields its value.
 // (A GCC/Clang statement expression, so error paths stay one line.)
-#define OM_TRY(expression)                                                                         \
-    ({                                                                                             \
-        auto omTryResult_ = (expression);                                                          \
-        if (!omTryResult_.ok())                                                                    \
-            return omTryResult_.error();                                                           \
-        std::move(omTryResult_).releaseValue();                                                    \
+#define OM_TRY(expression)                                                                                             \
+    ({                                                                                                                 \
+        auto omTryResult_ = (expression);                                                                              \
+        if (!omTryResult_.ok())                                                                                        \
+            return omTryResult_.error();                                                                               \
+        std::move(omTryResult_).releaseValue();                                                                        \
     })

@@ -42,8 +42,8 @@ Uuid Uuid::random()
         }
         filled += static_cast<size_t>(n);
     }
-    bytes[6] = static_cast<uint8_t>((bytes[6] & 0x0f) | 0x40);  // version 4
-    bytes[8] = static_cast<uint8_t>((bytes[8] & 0x3f) | 0x80);  // RFC 4122 variant
+    bytes[6] = static_cast<uint8_t>((bytes[6] & 0x0f) | 0x40); // version 4
+    bytes[8] = static_cast<uint8_t>((bytes[8] & 0x3f) | 0x80); // RFC 4122 variant
     return Uuid(bytes);
 }
 

@@ -14,8 +14,11 @@ class Uuid {
 public:
     using Bytes = std::array<uint8_t, 16>;
 
-    Uuid() = default;  // the nil UUID
-    explicit Uuid(const Bytes& bytes) : m_bytes(bytes) {}
+    Uuid() = default; // the nil UUID
+    explicit Uuid(const Bytes& bytes)
+        : m_bytes(bytes)
+    {
+    }
 
     // A version-4 random UUID from the kernel's random source.
     static Uuid random();

@@ -27,7 +27,7 @@ struct Value::DictionaryNode {
     static constexpr size_t kLinearLimit = 8;
 
     std::vector<Entry> entries;
-    std::vector<uint32_t> sorted;  // indexes into entries ordered by key; empty when small
+    std::vector<uint32_t> sorted; // indexes into entries ordered by key; empty when small
 
     const Value* find(std::string_view key) const
     {
@@ -38,8 +38,8 @@ struct Value::DictionaryNode {
             }
             return nullptr;
         }
-        auto it = std::lower_bound(sorted.begin(), sorted.end(), key,
-                                   [this](uint32_t i, std::string_view k) { return entries[i].first < k; });
+        auto it = std::lower_bound(
+            sorted.begin(), sorted.end(), key, [this](uint32_t i, std::string_view k) { return entries[i].first < k; });
         if (it != sorted.end() && entries[*it].first == key)
             return &entries[*it].second;
         return nullptr;
@@ -57,8 +57,8 @@ bool buildIndex(const std::vector<Value::Entry>& entries, std::vector<uint32_t>&
     sorted.resize(entries.size());
     for (uint32_t i = 0; i < sorted.size(); ++i)
         sorted[i] = i;
-    std::stable_sort(sorted.begin(), sorted.end(),
-                     [&](uint32_t a, uint32_t b) { return entries[a].first < entries[b].first; });
+    std::stable_sort(
+        sorted.begin(), sorted.end(), [&](uint32_t a, uint32_t b) { return entries[a].first < entries[b].first; });
     for (size_t i = 1; i < sorted.size(); ++i) {
         if (entries[sorted[i]].first == entries[sorted[i - 1]].first)
             return true;
@@ -94,8 +94,8 @@ std::vector<Value::Entry> foldRepeatedKeys(std::vector<Value::Entry> entries)
     std::vector<Value::Entry> folded;
     folded.reserve(entries.size());
     for (auto& entry : entries) {
-        auto it = std::find_if(folded.begin(), folded.end(),
-                               [&](const Value::Entry& e) { return e.first == entry.first; });
+        auto it
+            = std::find_if(folded.begin(), folded.end(), [&](const Value::Entry& e) { return e.first == entry.first; });
         if (it == folded.end())
             folded.push_back(std::move(entry));
         else
@@ -158,19 +158,19 @@ void appendReal(std::string& out, double d)
 
 Value Value::uuid(const Uuid& u)
 {
-    Value v(Type::Uuid, Scalar {.u = 0});
+    Value v(Type::Uuid, Scalar { .u = 0 });
     v.m_uuid = u;
     return v;
 }
 
 Value Value::string(std::string text)
 {
-    return Value(Type::String, std::make_shared<const StringNode>(StringNode {std::move(text)}));
+    return Value(Type::String, std::make_shared<const StringNode>(StringNode { std::move(text) }));
 }
 
 Value Value::data(std::vector<uint8_t> bytes)
 {
-    return Value(Type::Data, std::make_shared<const DataNode>(DataNode {std::move(bytes)}));
+    return Value(Type::Data, std::make_shared<const DataNode>(DataNode { std::move(bytes) }));
 }
 
 Value Value::data(std::span<const uint8_t> bytes)
@@ -180,7 +180,7 @@ Value Value::data(std::span<const uint8_t> bytes)
 
 Value Value::array(std::vector<Value> elements)
 {
-    return Value(Type::Array, std::make_shared<const ArrayNode>(ArrayNode {std::move(elements)}));
+    return Value(Type::Array, std::make_shared<const ArrayNode>(ArrayNode { std::move(elements) }));
 }
 
 Value Value::array(std::initializer_list<Value> elements)
@@ -232,7 +232,7 @@ std::string Value::dateText(double secondsSince1970)
         return "invalid-date";
     double whole = std::floor(secondsSince1970);
     auto seconds = static_cast<time_t>(whole);
-    struct tm parts {};
+    struct tm parts { };
     if (!gmtime_r(&seconds, &parts))
         return "invalid-date";
     char buffer[64];
@@ -241,7 +241,7 @@ std::string Value::dateText(double secondsSince1970)
     double fraction = secondsSince1970 - whole;
     if (fraction > 0) {
         char digits[32];
-        std::snprintf(digits, sizeof digits, "%.9f", fraction);  // "0.xxxxxxxxx"
+        std::snprintf(digits, sizeof digits, "%.9f", fraction); // "0.xxxxxxxxx"
         std::string tail(digits + 1);
         while (!tail.empty() && tail.back() == '0')
             tail.pop_back();
@@ -379,13 +379,13 @@ bool numbersEqual(const Value& a, const Value& b)
             return real >= 0 && real < 0x1p64 && static_cast<uint64_t>(real) == *u;
         return integer.isBoolean() && real == (*integer.asBool() ? 1.0 : 0.0);
     }
-    auto wide = [](const Value& v) -> std::pair<bool, uint64_t> {  // (negative, magnitude bits)
+    auto wide = [](const Value& v) -> std::pair<bool, uint64_t> { // (negative, magnitude bits)
         if (auto b = v.asBool())
-            return {false, *b ? 1u : 0u};
+            return { false, *b ? 1u : 0u };
         if (v.type() == Value::Type::Unsigned)
-            return {false, *v.asUInt64()};
+            return { false, *v.asUInt64() };
         int64_t i = *v.asInt64();
-        return {i < 0, static_cast<uint64_t>(i)};
+        return { i < 0, static_cast<uint64_t>(i) };
     };
     return wide(a) == wide(b);
 }
@@ -429,7 +429,7 @@ bool Value::operator==(const Value& other) const
         return true;
     }
     default:
-        return false;  // numbers handled above
+        return false; // numbers handled above
     }
 }
 

@@ -35,7 +35,7 @@ public:
         Dictionary,
         Array,
         String,
-        Integer,  // signed 64-bit
+        Integer, // signed 64-bit
         Unsigned, // unsigned 64-bit (values above INT64_MAX, or made unsigned on purpose)
         Real,
         Boolean,
@@ -51,21 +51,20 @@ public:
     // Scalars. The integer constructors are templates so that every integral type lands on the
     // right kind without ambiguity (bool excluded: use boolean()).
     template <typename I>
-        requires(std::is_integral_v<I> && !std::is_same_v<I, bool> && std::is_signed_v<I>)
-    static Value integer(I v)
+    requires(std::is_integral_v<I> && !std::is_same_v<I, bool> && std::is_signed_v<I>) static Value integer(I v)
     {
-        return Value(Type::Integer, Scalar {.i = static_cast<int64_t>(v)});
+        return Value(Type::Integer, Scalar { .i = static_cast<int64_t>(v) });
     }
     template <typename I>
-        requires(std::is_integral_v<I> && !std::is_same_v<I, bool> && std::is_unsigned_v<I>)
-    static Value unsignedInteger(I v)
+    requires(std::is_integral_v<I> && !std::is_same_v<I, bool> && std::is_unsigned_v<I>) static Value
+        unsignedInteger(I v)
     {
-        return Value(Type::Unsigned, Scalar {.u = static_cast<uint64_t>(v)});
+        return Value(Type::Unsigned, Scalar { .u = static_cast<uint64_t>(v) });
     }
-    static Value real(double v) { return Value(Type::Real, Scalar {.r = v}); }
-    static Value boolean(bool v) { return Value(Type::Boolean, Scalar {.b = v}); }
+    static Value real(double v) { return Value(Type::Real, Scalar { .r = v }); }
+    static Value boolean(bool v) { return Value(Type::Boolean, Scalar { .b = v }); }
     // Seconds since 1970-01-01 UTC.
-    static Value date(double secondsSince1970) { return Value(Type::Date, Scalar {.r = secondsSince1970}); }
+    static Value date(double secondsSince1970) { return Value(Type::Date, Scalar { .r = secondsSince1970 }); }
     static Value uuid(const Uuid& u);
 
     static Value string(std::string text);
@@ -79,16 +78,14 @@ public:
     static Value dictionary(std::initializer_list<Entry> entries);
     // For decoders, where a repeated key is an error: none when a key repeats, and the first
     // repeated key is stored in *duplicateKey when given.
-    static std::optional<Value> uniqueDictionary(std::vector<Entry> entries,
-                                                 std::string* duplicateKey = nullptr);
+    static std::optional<Value> uniqueDictionary(std::vector<Entry> entries, std::string* duplicateKey = nullptr);
     // ISO 8601 UTC text of a date ("2026-11-22T10:00:00Z"; fractional seconds only when present).
     static std::string dateText(double secondsSince1970);
 
     // Convenience conversions for literals in code and tests: integers keep their signedness,
     // bool is a boolean, floating point a real.
     template <typename T>
-        requires std::is_arithmetic_v<T>
-    Value(T v)
+    requires std::is_arithmetic_v<T> Value(T v)
     {
         if constexpr (std::is_same_v<T, bool>)
             *this = boolean(v);
@@ -99,9 +96,18 @@ public:
         else
             *this = unsignedInteger(v);
     }
-    Value(const char* text) : Value(string(text)) {}
-    Value(std::string text) : Value(string(std::move(text))) {}
-    Value(std::string_view text) : Value(string(std::string(text))) {}
+    Value(const char* text)
+        : Value(string(text))
+    {
+    }
+    Value(std::string text)
+        : Value(string(std::move(text)))
+    {
+    }
+    Value(std::string_view text)
+        : Value(string(std::string(text)))
+    {
+    }
 
     Type type() const { return m_type; }
     bool isNone() const { return m_type == Type::None; }
@@ -123,7 +129,7 @@ public:
     std::optional<int64_t> asInt64() const;
     std::optional<uint64_t> asUInt64() const;
     std::optional<double> asDouble() const;
-    std::optional<bool> asBool() const;  // booleans only
+    std::optional<bool> asBool() const; // booleans only
     std::optional<double> asDate() const;
     std::optional<Uuid> asUuid() const;
     const std::string* asString() const;
@@ -169,14 +175,22 @@ private:
     struct ArrayNode;
     struct DictionaryNode;
 
-    Value(Type type, Scalar scalar) : m_type(type), m_scalar(scalar) {}
-    Value(Type type, std::shared_ptr<const void> node) : m_type(type), m_node(std::move(node)) {}
+    Value(Type type, Scalar scalar)
+        : m_type(type)
+        , m_scalar(scalar)
+    {
+    }
+    Value(Type type, std::shared_ptr<const void> node)
+        : m_type(type)
+        , m_node(std::move(node))
+    {
+    }
 
     void describe(std::string& out, bool nested) const;
 
     Type m_type = Type::None;
-    Scalar m_scalar {.u = 0};
-    Uuid m_uuid;                       // only for Type::Uuid
+    Scalar m_scalar { .u = 0 };
+    Uuid m_uuid; // only for Type::Uuid
     std::shared_ptr<const void> m_node; // StringNode, DataNode, ArrayNode or DictionaryNode
 
     friend class DictionaryBuilder;
@@ -194,7 +208,7 @@ public:
     DictionaryBuilder& remove(std::string_view key);
     const Value& get(std::string_view key) const;
     size_t count() const { return m_entries.size(); }
-    Value build();  // leaves the builder empty
+    Value build(); // leaves the builder empty
 
 private:
     std::vector<Value::Entry> m_entries;
@@ -206,7 +220,7 @@ public:
     explicit ArrayBuilder(const Value& array);
     ArrayBuilder& append(Value value);
     size_t count() const { return m_elements.size(); }
-    Value build();  // leaves the builder empty
+    Value build(); // leaves the builder empty
 
 private:
     std::vector<Value> m_elements;

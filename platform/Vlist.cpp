@@ -16,10 +16,10 @@ namespace om {
 
 namespace {
 
-constexpr std::string_view kBinaryMagic {"vlst1\0", 6};
+constexpr std::string_view kBinaryMagic { "vlst1\0", 6 };
 constexpr std::string_view kBinaryFamily = "vlst";
 // Far above any bundle's Info.vlist or the daemon's own stores, well below a memory problem.
-constexpr size_t kMaxBytes = size_t {64} << 20;
+constexpr size_t kMaxBytes = size_t { 64 } << 20;
 
 bool startsWith(std::span<const uint8_t> bytes, std::string_view prefix)
 {
@@ -28,8 +28,8 @@ bool startsWith(std::span<const uint8_t> bytes, std::string_view prefix)
 
 OMError tooLarge(size_t size)
 {
-    return OMError::platform(kPlatformErrorLimit,
-                             "vlist of " + std::to_string(size) + " bytes exceeds the limit of 64 MiB");
+    return OMError::platform(
+        kPlatformErrorLimit, "vlist of " + std::to_string(size) + " bytes exceeds the limit of 64 MiB");
 }
 
 OMError withContext(const OMError& error, std::string_view context)
@@ -43,7 +43,7 @@ Result<std::vector<uint8_t>> readWholeFile(const std::filesystem::path& path)
     UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
     if (!fd.valid())
         return OMError::fromErrno("open " + path.string(), errno);
-    struct stat status {};
+    struct stat status { };
     if (::fstat(fd.get(), &status) != 0)
         return OMError::fromErrno("fstat " + path.string(), errno);
     if (!S_ISREG(status.st_mode))

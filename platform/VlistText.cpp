@@ -11,14 +11,14 @@ namespace {
 
 // Dates with whole seconds in (-2^62, 2^62) have calendar text; their day count and seconds stay
 // well inside int64 arithmetic. That is some 146 billion years either side of 1970.
-constexpr int64_t kCalendarLimit = int64_t {1} << 62;
+constexpr int64_t kCalendarLimit = int64_t { 1 } << 62;
 constexpr int64_t kSecondsPerDay = 86400;
 constexpr size_t kLongestYear = 12;
 
 struct CivilDate {
     int64_t year;
-    unsigned month;  // 1-12
-    unsigned day;    // 1-31
+    unsigned month; // 1-12
+    unsigned day; // 1-31
 };
 
 // Days since 1970-01-01 in the proleptic Gregorian calendar, and back (H. Hinnant's algorithms).
@@ -42,12 +42,12 @@ CivilDate civilFromDays(int64_t days)
     const unsigned mp = (5 * dayOfYear + 2) / 153;
     const unsigned month = mp < 10 ? mp + 3 : mp - 9;
     const unsigned day = dayOfYear - (153 * mp + 2) / 5 + 1;
-    return {static_cast<int64_t>(yearOfEra) + era * 400 + (month <= 2), month, day};
+    return { static_cast<int64_t>(yearOfEra) + era * 400 + (month <= 2), month, day };
 }
 
 unsigned daysInMonth(int64_t year, unsigned month)
 {
-    static constexpr unsigned kDays[] = {31, 28, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31};
+    static constexpr unsigned kDays[] = { 31, 28, 31, 30, 31, 30, 31, 31, 30, 31, 30, 31 };
     const bool leap = year % 4 == 0 && (year % 100 != 0 || year % 400 == 0);
     return month == 2 && leap ? 29 : kDays[month - 1];
 }
@@ -82,7 +82,7 @@ void appendCalendar(std::string& out, int64_t seconds, std::string_view fraction
 
     char year[24];
     auto [end, ec] = std::to_chars(year, year + sizeof year, date.year < 0 ? -date.year : date.year);
-    (void)ec;  // 24 characters hold any int64
+    (void)ec; // 24 characters hold any int64
     if (date.year < 0)
         out.push_back('-');
     else if (date.year > 9999)
@@ -192,7 +192,7 @@ void VlistText::appendDate(std::string& out, double secondsSince1970)
     // Here |seconds| < 2^52, so the shortest fixed form holds every integer digit exactly.
     char buffer[400];
     auto [end, ec] = std::to_chars(buffer, buffer + sizeof buffer, secondsSince1970, std::chars_format::fixed);
-    (void)ec;  // a double below 2^52 needs at most ~330 characters in fixed form
+    (void)ec; // a double below 2^52 needs at most ~330 characters in fixed form
     std::string_view text(buffer, static_cast<size_t>(end - buffer));
     const size_t point = text.find('.');
     std::string_view fraction = text.substr(point + 1);
@@ -213,10 +213,10 @@ std::optional<double> VlistText::parseDate(std::string_view text)
     size_t at = 0;
     int64_t year = 0;
     unsigned month, day, hour, minute, second;
-    if (!readYear(text, at, year) || !expect(text, at, '-') || !readDigits(text, at, 2, month)
-        || !expect(text, at, '-') || !readDigits(text, at, 2, day) || !expect(text, at, 'T')
-        || !readDigits(text, at, 2, hour) || !expect(text, at, ':') || !readDigits(text, at, 2, minute)
-        || !expect(text, at, ':') || !readDigits(text, at, 2, second))
+    if (!readYear(text, at, year) || !expect(text, at, '-') || !readDigits(text, at, 2, month) || !expect(text, at, '-')
+        || !readDigits(text, at, 2, day) || !expect(text, at, 'T') || !readDigits(text, at, 2, hour)
+        || !expect(text, at, ':') || !readDigits(text, at, 2, minute) || !expect(text, at, ':')
+        || !readDigits(text, at, 2, second))
         return std::nullopt;
     std::string_view fraction;
     if (at < text.size() && text[at] == '.') {
@@ -229,13 +229,12 @@ std::optional<double> VlistText::parseDate(std::string_view text)
     }
     if (at != text.size() - 1)
         return std::nullopt;
-    if (month < 1 || month > 12 || day < 1 || day > daysInMonth(year, month) || hour > 23 || minute > 59
-        || second > 59)
+    if (month < 1 || month > 12 || day < 1 || day > daysInMonth(year, month) || hour > 23 || minute > 59 || second > 59)
         return std::nullopt;
 
-    const int64_t days = daysFromCivil({year, month, day});
+    const int64_t days = daysFromCivil({ year, month, day });
     if (days < -kCalendarLimit / kSecondsPerDay - 1 || days > kCalendarLimit / kSecondsPerDay)
-        return std::nullopt;  // before the multiplication below could overflow
+        return std::nullopt; // before the multiplication below could overflow
     const int64_t whole = days * kSecondsPerDay + hour * 3600 + minute * 60 + second;
     if (whole <= -kCalendarLimit || whole >= kCalendarLimit)
         return std::nullopt;
@@ -254,7 +253,7 @@ void VlistText::appendReal(std::string& out, double value)
     }
     char buffer[32];
     auto [end, ec] = std::to_chars(buffer, buffer + sizeof buffer, value);
-    (void)ec;  // the shortest general form of a double fits in 24 characters
+    (void)ec; // the shortest general form of a double fits in 24 characters
     out.append(buffer, end);
 }
 
@@ -289,7 +288,7 @@ std::optional<Value> VlistText::parseInteger(std::string_view text, bool* outOfR
     }
     uint64_t magnitude = 0;
     auto [end, ec] = std::from_chars(text.data(), text.data() + text.size(), magnitude);
-    (void)end;  // every character is a digit
+    (void)end; // every character is a digit
     constexpr auto kSignedMax = static_cast<uint64_t>(std::numeric_limits<int64_t>::max());
     if (ec == std::errc::result_out_of_range || (negative && magnitude > kSignedMax + 1)) {
         if (outOfRange)
@@ -297,7 +296,7 @@ std::optional<Value> VlistText::parseInteger(std::string_view text, bool* outOfR
         return std::nullopt;
     }
     if (negative)
-        return Value::integer(static_cast<int64_t>(0 - magnitude));  // wraps to INT64_MIN at 2^63
+        return Value::integer(static_cast<int64_t>(0 - magnitude)); // wraps to INT64_MIN at 2^63
     if (magnitude > kSignedMax)
         return Value::unsignedInteger(magnitude);
     return Value::integer(static_cast<int64_t>(magnitude));
@@ -309,7 +308,7 @@ void VlistText::appendBase64(std::string& out, std::span<const uint8_t> bytes)
     out.reserve(out.size() + (bytes.size() + 2) / 3 * 4);
     size_t i = 0;
     for (; i + 3 <= bytes.size(); i += 3) {
-        const uint32_t group = uint32_t {bytes[i]} << 16 | uint32_t {bytes[i + 1]} << 8 | bytes[i + 2];
+        const uint32_t group = uint32_t { bytes[i] } << 16 | uint32_t { bytes[i + 1] } << 8 | bytes[i + 2];
         out.push_back(kAlphabet[group >> 18]);
         out.push_back(kAlphabet[group >> 12 & 0x3f]);
         out.push_back(kAlphabet[group >> 6 & 0x3f]);
@@ -318,7 +317,7 @@ void VlistText::appendBase64(std::string& out, std::span<const uint8_t> bytes)
     if (i == bytes.size())
         return;
     const bool two = bytes.size() - i == 2;
-    const uint32_t group = uint32_t {bytes[i]} << 16 | (two ? uint32_t {bytes[i + 1]} << 8 : 0);
+    const uint32_t group = uint32_t { bytes[i] } << 16 | (two ? uint32_t { bytes[i + 1] } << 8 : 0);
     out.push_back(kAlphabet[group >> 18]);
     out.push_back(kAlphabet[group >> 12 & 0x3f]);
     out.push_back(two ? kAlphabet[group >> 6 & 0x3f] : '=');

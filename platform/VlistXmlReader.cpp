@@ -4,8 +4,8 @@
 #include <libxml/parser.h>
 #include <libxml/tree.h>
 
-#include <cerrno>
 #include <algorithm>
+#include <cerrno>
 #include <climits>
 #include <memory>
 #include <mutex>
@@ -69,7 +69,7 @@ std::string quoted(std::string_view text)
         return '"' + std::string(text) + '"';
     size_t cut = kQuotedTextLimit;
     while (cut > 0 && (static_cast<uint8_t>(text[cut]) & 0xc0) == 0x80)
-        --cut;  // never split a UTF-8 sequence
+        --cut; // never split a UTF-8 sequence
     return '"' + std::string(text.substr(0, cut)) + "\"...";
 }
 
@@ -80,8 +80,8 @@ OMError malformed(long line, std::string_view what)
 
 OMError tooDeep(long line)
 {
-    return OMError::platform(kPlatformErrorLimit, "line " + std::to_string(line) + ": nesting deeper than "
-                                                      + std::to_string(Cbor::kMaxDepth) + " levels");
+    return OMError::platform(kPlatformErrorLimit,
+        "line " + std::to_string(line) + ": nesting deeper than " + std::to_string(Cbor::kMaxDepth) + " levels");
 }
 
 long lineOf(const xmlNode* node)
@@ -112,10 +112,17 @@ std::string tagOf(const xmlNode* node)
 Element elementOf(const xmlNode* node)
 {
     static constexpr std::pair<std::string_view, Element> kNames[] = {
-        {"dict", Element::Dict},       {"array", Element::Array}, {"string", Element::String},
-        {"integer", Element::Integer}, {"real", Element::Real},   {"true", Element::True},
-        {"false", Element::False},     {"data", Element::Data},   {"date", Element::Date},
-        {"uuid", Element::Uuid},       {"key", Element::Key},
+        { "dict", Element::Dict },
+        { "array", Element::Array },
+        { "string", Element::String },
+        { "integer", Element::Integer },
+        { "real", Element::Real },
+        { "true", Element::True },
+        { "false", Element::False },
+        { "data", Element::Data },
+        { "date", Element::Date },
+        { "uuid", Element::Uuid },
+        { "key", Element::Key },
     };
     if (node->ns)
         return Element::Unknown;
@@ -147,7 +154,8 @@ Result<xmlNode*> nextElement(xmlNode*& cursor, const xmlNode* parent)
         case XML_CDATA_SECTION_NODE: {
             const std::string_view text = view(cursor->content);
             if (!trimmed(text).empty())
-                return malformed(lineOfText(cursor, text), "unexpected text " + quoted(trimmed(text)) + " in " + tagOf(parent));
+                return malformed(
+                    lineOfText(cursor, text), "unexpected text " + quoted(trimmed(text)) + " in " + tagOf(parent));
             break;
         }
         case XML_ENTITY_REF_NODE:
@@ -197,8 +205,8 @@ Result<Value> readScalar(const xmlNode* element, Element kind)
         bool outOfRange = false;
         if (auto integer = VlistText::parseInteger(token, &outOfRange))
             return std::move(*integer);
-        return malformed(line, outOfRange ? "integer " + quoted(token) + " does not fit 64 bits"
-                                          : "invalid integer " + quoted(token));
+        return malformed(line,
+            outOfRange ? "integer " + quoted(token) + " does not fit 64 bits" : "invalid integer " + quoted(token));
     }
     case Element::Real:
         if (auto real = VlistText::parseReal(token))
@@ -336,18 +344,18 @@ void refuse(void* context, OMError error)
 // for them, so the first declaration ends the parse before it can be referenced.
 void refuseEntityDeclaration(void* context, const xmlChar* name, int, const xmlChar*, const xmlChar*, xmlChar*)
 {
-    refuse(context, malformed(xmlSAX2GetLineNumber(context), "entity declaration " + quoted(view(name)) + " is not allowed"));
+    refuse(context,
+        malformed(xmlSAX2GetLineNumber(context), "entity declaration " + quoted(view(name)) + " is not allowed"));
 }
 
 // Refuses depth while parsing, so that no deeper tree is built than the reader would accept.
 void startElement(void* context, const xmlChar* localName, const xmlChar* prefix, const xmlChar* uri,
-                  int namespaceCount, const xmlChar** namespaces, int attributeCount, int defaultedCount,
-                  const xmlChar** attributes)
+    int namespaceCount, const xmlChar** namespaces, int attributeCount, int defaultedCount, const xmlChar** attributes)
 {
     if (++guardOf(context).elementDepth > kMaxElementDepth)
         return refuse(context, tooDeep(xmlSAX2GetLineNumber(context)));
-    xmlSAX2StartElementNs(context, localName, prefix, uri, namespaceCount, namespaces, attributeCount,
-                          defaultedCount, attributes);
+    xmlSAX2StartElementNs(
+        context, localName, prefix, uri, namespaceCount, namespaces, attributeCount, defaultedCount, attributes);
 }
 
 // libxml2 numbers a text node by the line where its first chunk of characters ended; number it
@@ -359,7 +367,7 @@ void recordTextLine(void* context, const xmlChar* text, int length)
     xmlSAX2Characters(context, text, length);
     xmlNode* node = parser->node ? parser->node->last : nullptr;
     if (!node || node == before || node->type != XML_TEXT_NODE)
-        return;  // appended to the text node already there
+        return; // appended to the text node already there
     const long line = xmlSAX2GetLineNumber(context) - std::count(text, text + length, '\n');
     if (line < 65535) {
         node->line = static_cast<unsigned short>(line);
@@ -380,7 +388,8 @@ void endElement(void* context, const xmlChar* localName, const xmlChar* prefix, 
 Result<Value> VlistXmlReader::parse(std::span<const uint8_t> bytes)
 {
     if (bytes.size() > INT_MAX)
-        return OMError::platform(kPlatformErrorLimit, "XML vlist of " + std::to_string(bytes.size()) + " bytes is too large");
+        return OMError::platform(
+            kPlatformErrorLimit, "XML vlist of " + std::to_string(bytes.size()) + " bytes is too large");
     static std::once_flag initialized;
     std::call_once(initialized, xmlInitParser);
 
@@ -400,9 +409,9 @@ Result<Value> VlistXmlReader::parse(std::span<const uint8_t> bytes)
 
     // Not XML_PARSE_NOENT or XML_PARSE_DTDLOAD: nothing outside the bytes is ever read.
     constexpr int kOptions = XML_PARSE_NONET | XML_PARSE_NOCDATA | XML_PARSE_BIG_LINES | XML_PARSE_COMPACT
-                           | XML_PARSE_NOERROR | XML_PARSE_NOWARNING;
-    std::unique_ptr<xmlDoc, Document> document(xmlCtxtReadMemory(parser.get(), reinterpret_cast<const char*>(bytes.data()),
-                                                                  static_cast<int>(bytes.size()), nullptr, nullptr, kOptions));
+        | XML_PARSE_NOERROR | XML_PARSE_NOWARNING;
+    std::unique_ptr<xmlDoc, Document> document(xmlCtxtReadMemory(parser.get(),
+        reinterpret_cast<const char*>(bytes.data()), static_cast<int>(bytes.size()), nullptr, nullptr, kOptions));
     if (guard.refusal)
         return std::move(*guard.refusal);
     if (!document) {

@@ -11,7 +11,7 @@ namespace om {
 
 namespace {
 
-constexpr std::string_view kReplacement = "\xEF\xBF\xBD";  // U+FFFD
+constexpr std::string_view kReplacement = "\xEF\xBF\xBD"; // U+FFFD
 
 // The length of the well-formed UTF-8 sequence starting at text[at] (at least 2 bytes, since
 // text[at] is not ASCII), with its code point; 0 when ill-formed.
@@ -27,13 +27,13 @@ size_t decodeSequence(std::string_view text, size_t at, char32_t& codePoint)
     } else if (lead >= 0xe0 && lead <= 0xef) {
         length = 3;
         codePoint = lead & 0x0f;
-        low = lead == 0xe0 ? 0xa0 : 0x80;   // overlong
-        high = lead == 0xed ? 0x9f : 0xbf;  // surrogates
+        low = lead == 0xe0 ? 0xa0 : 0x80; // overlong
+        high = lead == 0xed ? 0x9f : 0xbf; // surrogates
     } else if (lead >= 0xf0 && lead <= 0xf4) {
         length = 4;
         codePoint = lead & 0x07;
-        low = lead == 0xf0 ? 0x90 : 0x80;   // overlong
-        high = lead == 0xf4 ? 0x8f : 0xbf;  // past U+10FFFF
+        low = lead == 0xf0 ? 0x90 : 0x80; // overlong
+        high = lead == 0xf4 ? 0x8f : 0xbf; // past U+10FFFF
     } else {
         return 0;
     }
@@ -84,7 +84,7 @@ const char* escapeOf(char c)
 bool appendEscaped(std::string& out, std::string_view text)
 {
     bool exact = true;
-    size_t run = 0;  // start of the bytes not yet copied
+    size_t run = 0; // start of the bytes not yet copied
     size_t at = 0;
     while (at < text.size()) {
         const char c = text[at];
@@ -124,7 +124,7 @@ template <typename Integer> void appendInteger(std::string& out, Integer value)
 {
     char buffer[24];
     auto [end, ec] = std::to_chars(buffer, buffer + sizeof buffer, value);
-    (void)ec;  // 24 characters hold any 64-bit integer
+    (void)ec; // 24 characters hold any 64-bit integer
     out.append(buffer, end);
 }
 
@@ -135,7 +135,7 @@ bool isInline(const Value& value)
 
 void appendIndent(std::string& out, unsigned level)
 {
-    out.append(size_t {level} * 2, ' ');
+    out.append(size_t { level } * 2, ' ');
 }
 
 // A scalar or an empty container, on one line.
@@ -260,8 +260,8 @@ void appendValue(std::string& out, const Value& value, unsigned level)
 // (and, for long ones, refaulting fresh pages) about log2(size) times.
 size_t estimatedSize(const Value& value, unsigned level)
 {
-    constexpr size_t kMarkup = 24;  // tags, indentation and a short scalar
-    size_t size = kMarkup + size_t {level} * 2;
+    constexpr size_t kMarkup = 24; // tags, indentation and a short scalar
+    size_t size = kMarkup + size_t { level } * 2;
     if (const std::string* text = value.asString())
         size += text->size();
     else if (const auto* bytes = value.asData())

@@ -155,7 +155,7 @@ void WorkQueue::async(std::function<void()> work)
     std::unique_lock lock(m_mutex);
     m_items.push_back(std::move(work));
     if (!protect) {
-        m_wake.notify_one();  // not shared (yet): notify under the lock, as nothing can free us
+        m_wake.notify_one(); // not shared (yet): notify under the lock, as nothing can free us
         return;
     }
     lock.unlock();

@@ -24,10 +24,9 @@ enum class QualityOfService : uint8_t { Background, Utility, Default, UserInitia
 
 class WorkQueue : public std::enable_shared_from_this<WorkQueue> {
 public:
-    static std::shared_ptr<WorkQueue> create(std::string label,
-                                             QualityOfService qos = QualityOfService::Default,
-                                             int relativePriority = 0);
-    ~WorkQueue();  // runs what is queued, then joins the thread
+    static std::shared_ptr<WorkQueue> create(
+        std::string label, QualityOfService qos = QualityOfService::Default, int relativePriority = 0);
+    ~WorkQueue(); // runs what is queued, then joins the thread
 
     WorkQueue(const WorkQueue&) = delete;
     WorkQueue& operator=(const WorkQueue&) = delete;

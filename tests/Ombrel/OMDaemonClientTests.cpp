@@ -1,5 +1,4 @@
 #include <gtest/gtest.h>
-
 #include <stdlib.h>
 
 #include <chrono>
@@ -178,19 +177,19 @@ protected:
 
 TEST_F(OMDaemonClientTest, AddPlugInsSendsTheEnvelopeAndThePathsInOrder)
 {
-    Value paths = Value::array({"/Applications/B.app/PlugIns/b.appex", "/a"});
+    Value paths = Value::array({ "/Applications/B.app/PlugIns/b.appex", "/a" });
     Value request = sent([&](auto reply) { m_client->addPlugIns(paths, reply); });
 
-    EXPECT_EQ(request, Value::dictionary({{"request", "add"}, {"version", 3u}, {"paths", paths}}));
-    EXPECT_EQ(keysOf(request), (std::vector<std::string> {"request", "version", "paths"}));
+    EXPECT_EQ(request, Value::dictionary({ { "request", "add" }, { "version", 3u }, { "paths", paths } }));
+    EXPECT_EQ(keysOf(request), (std::vector<std::string> { "request", "version", "paths" }));
 }
 
 TEST_F(OMDaemonClientTest, RemovePlugInsSendsPaths)
 {
-    Value paths = Value::array({"/x.appex"});
+    Value paths = Value::array({ "/x.appex" });
     Value request = sent([&](auto reply) { m_client->removePlugIns(paths, reply); });
 
-    EXPECT_EQ(request, Value::dictionary({{"request", "remove"}, {"version", 3u}, {"paths", paths}}));
+    EXPECT_EQ(request, Value::dictionary({ { "request", "remove" }, { "version", 3u }, { "paths", paths } }));
 }
 
 TEST_F(OMDaemonClientTest, EmptyPathListStillTravelsAsAnArray)
@@ -206,7 +205,7 @@ TEST_F(OMDaemonClientTest, BulkSendsFlagsAsUnsigned64Bit)
 {
     Value request = sent([&](auto reply) { m_client->bulkPlugins(std::numeric_limits<uint64_t>::max(), reply); });
 
-    EXPECT_EQ(keysOf(request), (std::vector<std::string> {"request", "version", "flags"}));
+    EXPECT_EQ(keysOf(request), (std::vector<std::string> { "request", "version", "flags" }));
     EXPECT_EQ(*request.stringFor("request"), "bulk");
     EXPECT_EQ(request["flags"].type(), Value::Type::Unsigned);
     EXPECT_EQ(request["flags"].asUInt64(), std::numeric_limits<uint64_t>::max());
@@ -214,39 +213,37 @@ TEST_F(OMDaemonClientTest, BulkSendsFlagsAsUnsigned64Bit)
 
 TEST_F(OMDaemonClientTest, ReadySendsFlagsAndUuidValuesInTheGivenOrder)
 {
-    Value request = sent([&](auto reply) { m_client->readyPlugIns({kThird, kFirst, kThird}, 5, reply); });
+    Value request = sent([&](auto reply) { m_client->readyPlugIns({ kThird, kFirst, kThird }, 5, reply); });
 
-    EXPECT_EQ(request, Value::dictionary({{"request", "ready"},
-                                          {"version", 3u},
-                                          {"flags", 5u},
-                                          {"uuids", Value::array({Value::uuid(kThird), Value::uuid(kFirst),
-                                                                  Value::uuid(kThird)})}}));
-    EXPECT_EQ(keysOf(request), (std::vector<std::string> {"request", "version", "flags", "uuids"}));
+    EXPECT_EQ(request,
+        Value::dictionary({ { "request", "ready" }, { "version", 3u }, { "flags", 5u },
+            { "uuids", Value::array({ Value::uuid(kThird), Value::uuid(kFirst), Value::uuid(kThird) }) } }));
+    EXPECT_EQ(keysOf(request), (std::vector<std::string> { "request", "version", "flags", "uuids" }));
     for (const Value& uuid : request["uuids"].elements())
         EXPECT_EQ(uuid.type(), Value::Type::Uuid);
 }
 
 TEST_F(OMDaemonClientTest, AccessSendsFlagsAndUuids)
 {
-    Value request = sent([&](auto reply) { m_client->accessPlugIns({kSecond}, 0, reply); });
+    Value request = sent([&](auto reply) { m_client->accessPlugIns({ kSecond }, 0, reply); });
 
-    EXPECT_EQ(request, Value::dictionary({{"request", "access"},
-                                          {"version", 3u},
-                                          {"flags", 0u},
-                                          {"uuids", Value::array({Value::uuid(kSecond)})}}));
+    EXPECT_EQ(request,
+        Value::dictionary({ { "request", "access" }, { "version", 3u }, { "flags", 0u },
+            { "uuids", Value::array({ Value::uuid(kSecond) }) } }));
 }
 
 TEST_F(OMDaemonClientTest, MatchSendsTheRulesTreeWholeAndTheFlags)
 {
     Value rules = Value::dictionary({
-        {"QSExtensionPointName", "com.orvex.share"},
-        {"attributes", Value::dictionary({{"count", Value::integer(-2)}, {"when", Value::date(86400)}})},
-        {"blob", Value::data(std::vector<uint8_t> {0, 1, 255})},
+        { "QSExtensionPointName", "com.orvex.share" },
+        { "attributes", Value::dictionary({ { "count", Value::integer(-2) }, { "when", Value::date(86400) } }) },
+        { "blob", Value::data(std::vector<uint8_t> { 0, 1, 255 }) },
     });
     Value request = sent([&](auto reply) { m_client->matchPlugIns(rules, 0x209, reply); });
 
-    EXPECT_EQ(request, Value::dictionary({{"request", "match"}, {"version", 3u}, {"rules", rules}, {"flags", 0x209u}}));
-    EXPECT_EQ(keysOf(request), (std::vector<std::string> {"request", "version", "rules", "flags"}));
+    EXPECT_EQ(request,
+        Value::dictionary({ { "request", "match" }, { "version", 3u }, { "rules", rules }, { "flags", 0x209u } }));
+    EXPECT_EQ(keysOf(request), (std::vector<std::string> { "request", "version", "rules", "flags" }));
     EXPECT_EQ(request["rules"]["attributes"]["when"].type(), Value::Type::Date);
 }
 
@@ -254,43 +251,47 @@ TEST_F(OMDaemonClientTest, MatchWithoutRulesOmitsTheKey)
 {
     Value request = sent([&](auto reply) { m_client->matchPlugIns(Value(), 0, reply); });
 
-    EXPECT_EQ(keysOf(request), (std::vector<std::string> {"request", "version", "flags"}));
+    EXPECT_EQ(keysOf(request), (std::vector<std::string> { "request", "version", "flags" }));
 }
 
 TEST_F(OMDaemonClientTest, AnnotateSendsUuidsAndAnnotations)
 {
-    Value annotations = Value::dictionary({{"election", 1}, {"extension", Value::dictionary({{"k", "v"}})}});
-    Value request = sent([&](auto reply) { m_client->setPluginAnnotations({kFirst, kSecond}, annotations, reply); });
+    Value annotations = Value::dictionary({ { "election", 1 }, { "extension", Value::dictionary({ { "k", "v" } }) } });
+    Value request = sent([&](auto reply) { m_client->setPluginAnnotations({ kFirst, kSecond }, annotations, reply); });
 
-    EXPECT_EQ(request, Value::dictionary({{"request", "annotate"},
-                                          {"version", 3u},
-                                          {"uuids", Value::array({Value::uuid(kFirst), Value::uuid(kSecond)})},
-                                          {"annotations", annotations}}));
-    EXPECT_EQ(keysOf(request), (std::vector<std::string> {"request", "version", "uuids", "annotations"}));
+    EXPECT_EQ(request,
+        Value::dictionary({ { "request", "annotate" }, { "version", 3u },
+            { "uuids", Value::array({ Value::uuid(kFirst), Value::uuid(kSecond) }) },
+            { "annotations", annotations } }));
+    EXPECT_EQ(keysOf(request), (std::vector<std::string> { "request", "version", "uuids", "annotations" }));
 }
 
 TEST_F(OMDaemonClientTest, BulkAnnotateSendsOnlyTheAnnotations)
 {
-    Value annotations = Value::dictionary({{kFirst.string(), Value::dictionary({{"enabled", true}})}});
+    Value annotations = Value::dictionary({ { kFirst.string(), Value::dictionary({ { "enabled", true } }) } });
     Value request = sent([&](auto reply) { m_client->bulkSetPluginAnnotations(annotations, reply); });
 
-    EXPECT_EQ(request, Value::dictionary({{"request", "bulk-annotate"}, {"version", 3u}, {"annotations", annotations}}));
+    EXPECT_EQ(request,
+        Value::dictionary({ { "request", "bulk-annotate" }, { "version", 3u }, { "annotations", annotations } }));
 }
 
 TEST_F(OMDaemonClientTest, HoldSendsLockWithPathsAndFlags)
 {
-    Value paths = Value::array({"/Applications/A.app"});
+    Value paths = Value::array({ "/Applications/A.app" });
     Value request = sent([&](auto reply) { m_client->holdPlugins(paths, 0x6, reply); });
 
-    EXPECT_EQ(request, Value::dictionary({{"request", "lock"}, {"version", 3u}, {"paths", paths}, {"flags", 6u}}));
-    EXPECT_EQ(keysOf(request), (std::vector<std::string> {"request", "version", "paths", "flags"}));
+    EXPECT_EQ(
+        request, Value::dictionary({ { "request", "lock" }, { "version", 3u }, { "paths", paths }, { "flags", 6u } }));
+    EXPECT_EQ(keysOf(request), (std::vector<std::string> { "request", "version", "paths", "flags" }));
 }
 
 TEST_F(OMDaemonClientTest, ReleaseHoldSendsOneTokenAndNoFlags)
 {
     Value request = sent([&](auto reply) { m_client->releaseHold(kFirst, reply); });
 
-    EXPECT_EQ(request, Value::dictionary({{"request", "lock"}, {"version", 3u}, {"uuids", Value::array({Value::uuid(kFirst)})}}));
+    EXPECT_EQ(request,
+        Value::dictionary(
+            { { "request", "lock" }, { "version", 3u }, { "uuids", Value::array({ Value::uuid(kFirst) }) } }));
     EXPECT_FALSE(request.contains("flags"));
     EXPECT_FALSE(request.contains("paths"));
 }
@@ -308,18 +309,18 @@ TEST_F(OMDaemonClientTest, RequestBuilderUsesTheProtocolVersion)
 
 TEST_F(OMDaemonClientTest, SetUuidsReplacesAnEarlierListInPlace)
 {
-    auto request = m_client->request("ready", Value::array({"/p"}));
-    OMDaemonClient::set(request, {kFirst, kSecond});
-    OMDaemonClient::set(request, {kThird});
+    auto request = m_client->request("ready", Value::array({ "/p" }));
+    OMDaemonClient::set(request, { kFirst, kSecond });
+    OMDaemonClient::set(request, { kThird });
     Value built = request.build();
 
-    EXPECT_EQ(keysOf(built), (std::vector<std::string> {"request", "version", "paths", "uuids"}));
-    EXPECT_EQ(built["uuids"], Value::array({Value::uuid(kThird)}));
+    EXPECT_EQ(keysOf(built), (std::vector<std::string> { "request", "version", "paths", "uuids" }));
+    EXPECT_EQ(built["uuids"], Value::array({ Value::uuid(kThird) }));
 }
 
 TEST_F(OMDaemonClientTest, ReplyArrivesUnchangedOnTheReplyQueue)
 {
-    Value answer = Value::dictionary({{"uuids", Value::uuid(kFirst)}, {"extensions", Value::array({"token"})}});
+    Value answer = Value::dictionary({ { "uuids", Value::uuid(kFirst) }, { "extensions", Value::array({ "token" }) } });
     m_daemon->setReply(answer);
     bool onReplyQueue = false;
     Result<Value> reply = await([&](auto block) {
@@ -355,13 +356,13 @@ TEST_F(OMDaemonClientTest, RepliesReachTheirBlocksInRequestOrder)
 
     auto future = seen->done.get_future();
     ASSERT_EQ(future.wait_for(kGenerous), std::future_status::ready);
-    EXPECT_EQ(future.get(), (std::vector<int> {0, 1, 2, 3, 4}));
+    EXPECT_EQ(future.get(), (std::vector<int> { 0, 1, 2, 3, 4 }));
 }
 
 TEST_F(OMDaemonClientTest, RequestsAndRepliesAreTracedInTheTrafficCategory)
 {
     Log::Capture capture;
-    m_daemon->setReply(Value::dictionary({{"errorcode", 4u}, {"error", "unrecognized request"}}));
+    m_daemon->setReply(Value::dictionary({ { "errorcode", 4u }, { "error", "unrecognized request" } }));
     (void)sent([&](auto reply) { m_client->bulkPlugins(0, reply); });
 
     auto records = capture.records();
@@ -447,31 +448,32 @@ TEST_F(OMDaemonClientTest, UnreachableServiceGivesTransportError)
 
 TEST_F(OMDaemonClientTest, SendSyncReturnsTheReply)
 {
-    m_daemon->setReply(Value::dictionary({{"errorcode", 4u}, {"error", "unrecognized request"}}));
+    m_daemon->setReply(Value::dictionary({ { "errorcode", 4u }, { "error", "unrecognized request" } }));
     Result<Value> reply = m_client->sendSync(m_client->request("ping").build());
 
     ASSERT_TRUE(reply.ok());
     EXPECT_EQ(*reply->stringFor("error"), "unrecognized request");
-    EXPECT_EQ(m_daemon->nextRequest(), Value::dictionary({{"request", "ping"}, {"version", 3u}}));
+    EXPECT_EQ(m_daemon->nextRequest(), Value::dictionary({ { "request", "ping" }, { "version", 3u } }));
 }
 
 TEST_F(OMDaemonClientTest, SendSyncOnTheReplyQueueIsAProgrammingError)
 {
     GTEST_FLAG_SET(death_test_style, "threadsafe");
     EXPECT_DEATH(m_client->replyQueue()->sync([&] { (void)m_client->sendSync(m_client->request("ping").build()); }),
-                 "must not run on work queue \"omd_client\"");
+        "must not run on work queue \"omd_client\"");
 }
 
 TEST(OMDaemonClientErrorInReply, SuccessReplyHasNoError)
 {
     EXPECT_FALSE(OMDaemonClient::errorInReply(Value::dictionary({})).has_value());
-    EXPECT_FALSE(OMDaemonClient::errorInReply(Value::dictionary({{"errorcode", 0u}})).has_value());
-    EXPECT_FALSE(OMDaemonClient::errorInReply(Value::dictionary({{"uuids", Value::uuid(kFirst)}})).has_value());
+    EXPECT_FALSE(OMDaemonClient::errorInReply(Value::dictionary({ { "errorcode", 0u } })).has_value());
+    EXPECT_FALSE(OMDaemonClient::errorInReply(Value::dictionary({ { "uuids", Value::uuid(kFirst) } })).has_value());
 }
 
 TEST(OMDaemonClientErrorInReply, CodeAndTextAreTakenAsTheyCame)
 {
-    auto error = OMDaemonClient::errorInReply(Value::dictionary({{"errorcode", 9u}, {"error", "no plugin at /x"}}));
+    auto error
+        = OMDaemonClient::errorInReply(Value::dictionary({ { "errorcode", 9u }, { "error", "no plugin at /x" } }));
 
     ASSERT_TRUE(error.has_value());
     EXPECT_EQ(*error, OMError("Ombrel", 9, "no plugin at /x"));
@@ -479,7 +481,7 @@ TEST(OMDaemonClientErrorInReply, CodeAndTextAreTakenAsTheyCame)
 
 TEST(OMDaemonClientErrorInReply, CodeWithoutTextGetsTheGenericMessage)
 {
-    auto error = OMDaemonClient::errorInReply(Value::dictionary({{"errorcode", 14u}}));
+    auto error = OMDaemonClient::errorInReply(Value::dictionary({ { "errorcode", 14u } }));
 
     ASSERT_TRUE(error.has_value());
     EXPECT_EQ(*error, OMError("Ombrel", 14, "unknown error returned by Ombrel subsystem"));
@@ -488,8 +490,8 @@ TEST(OMDaemonClientErrorInReply, CodeWithoutTextGetsTheGenericMessage)
 TEST(OMDaemonClientErrorInReply, NegativeCodeWidenedOnTheWireComesBackNegative)
 {
     auto widened = OMDaemonClient::errorInReply(
-        Value::dictionary({{"errorcode", static_cast<uint64_t>(int64_t {-3})}, {"error", "x"}}));
-    auto signedForm = OMDaemonClient::errorInReply(Value::dictionary({{"errorcode", -3}, {"error", "x"}}));
+        Value::dictionary({ { "errorcode", static_cast<uint64_t>(int64_t { -3 }) }, { "error", "x" } }));
+    auto signedForm = OMDaemonClient::errorInReply(Value::dictionary({ { "errorcode", -3 }, { "error", "x" } }));
 
     ASSERT_TRUE(widened && signedForm);
     EXPECT_EQ(widened->code(), -3);
@@ -498,7 +500,8 @@ TEST(OMDaemonClientErrorInReply, NegativeCodeWidenedOnTheWireComesBackNegative)
 
 TEST(OMDaemonClientErrorInReply, TransportErrorBecomesCodeFourWithItsDescription)
 {
-    auto error = OMDaemonClient::errorInReply(OMError(kConduitErrorDomain, kConduitConnectionInvalid, "Connection invalid"));
+    auto error
+        = OMDaemonClient::errorInReply(OMError(kConduitErrorDomain, kConduitConnectionInvalid, "Connection invalid"));
 
     ASSERT_TRUE(error.has_value());
     EXPECT_EQ(*error, OMError("Ombrel", 4, "Connection invalid"));
@@ -507,15 +510,15 @@ TEST(OMDaemonClientErrorInReply, TransportErrorBecomesCodeFourWithItsDescription
 TEST(OMDaemonClientErrorInReplyDeathTest, TextWithoutCodeIsAProtocolViolation)
 {
     GTEST_FLAG_SET(death_test_style, "threadsafe");
-    EXPECT_DEATH((void)OMDaemonClient::errorInReply(Value::dictionary({{"errorcode", 0u}, {"error", "boom"}})),
-                 "omd reported error without a code: boom");
-    EXPECT_DEATH((void)OMDaemonClient::errorInReply(Value::dictionary({{"error", "bang"}})),
-                 "omd reported error without a code: bang");
+    EXPECT_DEATH((void)OMDaemonClient::errorInReply(Value::dictionary({ { "errorcode", 0u }, { "error", "boom" } })),
+        "omd reported error without a code: boom");
+    EXPECT_DEATH((void)OMDaemonClient::errorInReply(Value::dictionary({ { "error", "bang" } })),
+        "omd reported error without a code: bang");
 }
 
 TEST(OMDaemonClientConversion, OnlyVersionThreeHasAnEncoding)
 {
-    Value tree = Value::array({Value::dictionary({{"identifier", "a"}})});
+    Value tree = Value::array({ Value::dictionary({ { "identifier", "a" } }) });
 
     EXPECT_FALSE(OMDaemonClient::convertToConduit(tree, 2).has_value());
     EXPECT_FALSE(OMDaemonClient::convertToConduit(tree, 4).has_value());
@@ -526,8 +529,9 @@ TEST(OMDaemonClientConversion, OnlyVersionThreeHasAnEncoding)
 TEST(OMDaemonClientConversion, VersionThreeIsOneDataValueThatDecodesBack)
 {
     Value tree = Value::array({
-        Value::dictionary({{"identifier", "a"}, {"uuid", Value::uuid(kFirst)}, {"lastmodified", Value::date(1.5)}}),
-        Value::dictionary({{"version", std::numeric_limits<uint64_t>::max()}, {"systemResident", true}}),
+        Value::dictionary(
+            { { "identifier", "a" }, { "uuid", Value::uuid(kFirst) }, { "lastmodified", Value::date(1.5) } }),
+        Value::dictionary({ { "version", std::numeric_limits<uint64_t>::max() }, { "systemResident", true } }),
     });
     auto encoded = OMDaemonClient::convertToConduit(tree, 3);
     ASSERT_TRUE(encoded.has_value());

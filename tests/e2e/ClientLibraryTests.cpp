@@ -1,6 +1,5 @@
 // The client library against the real daemon: what a host program sees through OMDaemonClient.
 #include <gtest/gtest.h>
-
 #include <stdlib.h>
 
 #include <future>
@@ -48,7 +47,7 @@ protected:
     {
         DaemonProcess::Options options;
         options.executable = om::test::builtDaemonPath();
-        options.arguments = {"-S", "com.orvex.test.client-library"};
+        options.arguments = { "-S", "com.orvex.test.client-library" };
         m_daemon = std::make_unique<DaemonProcess>(options);
         ASSERT_TRUE(m_daemon->waitForSocket()) << m_daemon->stderrText();
         ASSERT_TRUE(connectable(m_daemon->socketPath()));
@@ -94,7 +93,7 @@ TEST_F(ClientLibraryTest, NameDifferingOnlyInCaseIsUnknown)
 
 TEST_F(ClientLibraryTest, RequestWithoutANameIsMalformed)
 {
-    auto error = errorOf(Value::dictionary({{"version", 3u}}));
+    auto error = errorOf(Value::dictionary({ { "version", 3u } }));
 
     ASSERT_TRUE(error.has_value());
     EXPECT_EQ(*error, OMError(kOMErrorDomain, 4, "invalid request format (missing type)"));

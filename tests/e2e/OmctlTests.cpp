@@ -1,8 +1,7 @@
 // The omctl binary as people and scripts run it: against the real daemon, against an in-process
 // service that records exactly what omctl sent, and with hostile JSON.
-#include <gtest/gtest.h>
-
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <poll.h>
 #include <signal.h>
 #include <stdlib.h>
@@ -34,17 +33,18 @@ namespace {
 constexpr auto kGenerous = std::chrono::seconds(60);
 
 struct Outcome {
-    int status = -1;  // exit status; -1 when it did not exit normally
+    int status = -1; // exit status; -1 when it did not exit normally
     std::string out;
     std::string err;
 };
 
 // Runs omctl with CONDUIT_DIR set to conduitDirectory, feeding it input on standard input.
-Outcome omctl(const std::vector<std::string>& arguments, const std::string& conduitDirectory, const std::string& input = {})
+Outcome omctl(
+    const std::vector<std::string>& arguments, const std::string& conduitDirectory, const std::string& input = {})
 {
-    std::vector<std::string> argumentStorage = {std::string(OM_BINARY_DIR) + "/tools/omctl/omctl"};
+    std::vector<std::string> argumentStorage = { std::string(OM_BINARY_DIR) + "/tools/omctl/omctl" };
     argumentStorage.insert(argumentStorage.end(), arguments.begin(), arguments.end());
-    std::vector<std::string> environmentStorage = {"CONDUIT_DIR=" + conduitDirectory};
+    std::vector<std::string> environmentStorage = { "CONDUIT_DIR=" + conduitDirectory };
     for (char** entry = environ; *entry; ++entry) {
         if (!std::string_view(*entry).starts_with("CONDUIT_DIR="))
             environmentStorage.emplace_back(*entry);
@@ -82,11 +82,11 @@ Outcome omctl(const std::vector<std::string>& arguments, const std::string& cond
         ::close(inFd);
         inFd = -1;
     }
-    std::string* sinks[] = {&run.out, &run.err};
-    int open[] = {out[0], err[0]};
+    std::string* sinks[] = { &run.out, &run.err };
+    int open[] = { out[0], err[0] };
     auto deadline = std::chrono::steady_clock::now() + kGenerous;
     while (open[0] >= 0 || open[1] >= 0) {
-        pollfd fds[3] = {{open[0], POLLIN, 0}, {open[1], POLLIN, 0}, {inFd, POLLOUT, 0}};
+        pollfd fds[3] = { { open[0], POLLIN, 0 }, { open[1], POLLIN, 0 }, { inFd, POLLOUT, 0 } };
         auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
         if (left.count() <= 0 || ::poll(fds, 3, static_cast<int>(left.count())) <= 0) {
             ADD_FAILURE() << "omctl did not finish in time";
@@ -115,7 +115,7 @@ Outcome omctl(const std::vector<std::string>& arguments, const std::string& cond
             }
         }
     }
-    for (int fd : {open[0], open[1], inFd}) {
+    for (int fd : { open[0], open[1], inFd }) {
         if (fd >= 0)
             ::close(fd);
     }
@@ -134,7 +134,8 @@ std::string temporaryDirectory()
 // Plays omd in the test process: records each request omctl sends and answers with a fixed reply.
 class RecordingService {
 public:
-    RecordingService(const std::string& name, Value reply) : m_reply(std::move(reply))
+    RecordingService(const std::string& name, Value reply)
+        : m_reply(std::move(reply))
     {
         auto listener = ConduitListener::create(name, m_queue);
         if (!listener.ok()) {
@@ -187,7 +188,7 @@ private:
     std::deque<Value> m_requests;
 };
 
-const Value kEcho = Value::dictionary({{"errorcode", 0u}});
+const Value kEcho = Value::dictionary({ { "errorcode", 0u } });
 
 class OmctlTest : public ::testing::Test {
 protected:
@@ -207,13 +208,13 @@ protected:
     Value sentFor(const std::string& json)
     {
         RecordingService service("fake", kEcho);
-        Outcome outcome = omctl({"--service", "fake", "raw", json}, m_directory);
+        Outcome outcome = omctl({ "--service", "fake", "raw", json }, m_directory);
         EXPECT_EQ(outcome.status, 0) << outcome.err;
         return outcome.status == 0 ? service.takeRequest() : Value();
     }
 
     // Runs "omctl raw <json>" where nothing listens: a parse failure exits 2 before connecting.
-    Outcome refused(const std::string& json) { return omctl({"--service", "nobody", "raw", json}, m_directory); }
+    Outcome refused(const std::string& json) { return omctl({ "--service", "nobody", "raw", json }, m_directory); }
 
     std::string m_directory;
 };
@@ -236,7 +237,7 @@ protected:
     {
         DaemonProcess::Options options;
         options.executable = om::test::builtDaemonPath();
-        options.arguments = {"-S", "com.orvex.test.omctl"};
+        options.arguments = { "-S", "com.orvex.test.omctl" };
         m_daemon = std::make_unique<DaemonProcess>(options);
         ASSERT_TRUE(m_daemon->waitForSocket()) << m_daemon->stderrText();
         ASSERT_TRUE(connectable(m_daemon->socketPath()));
@@ -244,7 +245,7 @@ protected:
 
     Outcome run(std::vector<std::string> arguments, const std::string& input = {})
     {
-        arguments.insert(arguments.begin(), {"--service", m_daemon->serviceName()});
+        arguments.insert(arguments.begin(), { "--service", m_daemon->serviceName() });
         return omctl(arguments, m_daemon->conduitDirectory(), input);
     }
 
@@ -260,7 +261,7 @@ std::string nested(size_t depth, const std::string& inner)
 
 TEST_F(OmctlDaemonTest, RawInlineJsonPrintsTheReplyAndExitsOneOnError)
 {
-    Outcome result = run({"raw", R"({"request": "ping", "version": 3})"});
+    Outcome result = run({ "raw", R"({"request": "ping", "version": 3})" });
 
     EXPECT_EQ(result.status, 1);
     EXPECT_EQ(result.out, "errorcode: 4\nerror: unrecognized request\n");
@@ -270,8 +271,8 @@ TEST_F(OmctlDaemonTest, RawInlineJsonPrintsTheReplyAndExitsOneOnError)
 TEST_F(OmctlDaemonTest, RawVlistFileIsSentAsWritten)
 {
     std::string path = m_daemon->root() + "/request.vlist";
-    std::ofstream(path) << Vlist::writeXml(Value::dictionary({{"request", "ping"}}));
-    Outcome result = run({"raw", "--file", path});
+    std::ofstream(path) << Vlist::writeXml(Value::dictionary({ { "request", "ping" } }));
+    Outcome result = run({ "raw", "--file", path });
 
     // No version: the daemon reads 0.
     EXPECT_EQ(result.status, 1);
@@ -281,7 +282,7 @@ TEST_F(OmctlDaemonTest, RawVlistFileIsSentAsWritten)
 
 TEST_F(OmctlDaemonTest, RawJsonFromStandardInput)
 {
-    Outcome result = run({"--json", "raw", "-"}, R"({"version": 3})");
+    Outcome result = run({ "--json", "raw", "-" }, R"({"version": 3})");
 
     EXPECT_EQ(result.status, 1);
     EXPECT_EQ(result.out, "{\n  \"errorcode\": 4,\n  \"error\": \"invalid request format (missing type)\"\n}\n");
@@ -289,7 +290,7 @@ TEST_F(OmctlDaemonTest, RawJsonFromStandardInput)
 
 TEST_F(OmctlDaemonTest, PingReportsTheDaemonAnswering)
 {
-    Outcome result = run({"ping", "--count", "2"});
+    Outcome result = run({ "ping", "--count", "2" });
 
     EXPECT_EQ(result.status, 0) << result.err;
     std::string expected = "omd at " + m_daemon->socketPath() + " is answering (round trip ";
@@ -300,7 +301,7 @@ TEST_F(OmctlDaemonTest, PingReportsTheDaemonAnswering)
 TEST_F(OmctlDaemonTest, StoppedDaemonIsUnreachable)
 {
     ASSERT_TRUE(m_daemon->stop().has_value());
-    Outcome result = run({"ping"});
+    Outcome result = run({ "ping" });
 
     EXPECT_EQ(result.status, 3);
     EXPECT_NE(result.err.find("omctl: cannot reach omd at " + m_daemon->socketPath() + ": "), std::string::npos)
@@ -309,7 +310,7 @@ TEST_F(OmctlDaemonTest, StoppedDaemonIsUnreachable)
 
 TEST_F(OmctlTest, UnreachableServiceExitsThree)
 {
-    Outcome result = omctl({"--service", "nobody", "raw", R"({"request": "match"})"}, m_directory);
+    Outcome result = omctl({ "--service", "nobody", "raw", R"({"request": "match"})" }, m_directory);
 
     EXPECT_EQ(result.status, 3);
     EXPECT_NE(result.err.find("omctl: cannot reach omd at " + m_directory + "/nobody: "), std::string::npos)
@@ -321,21 +322,21 @@ TEST_F(OmctlTest, UsageErrorsExitTwo)
 {
     const std::vector<std::vector<std::string>> cases = {
         {},
-        {"frobnicate"},
-        {"--bogus", "ping"},
-        {"--service"},
-        {"--service="},
-        {"raw"},
-        {"raw", "{}", "{}"},
-        {"raw", "--file"},
-        {"raw", "--file", m_directory + "/missing.vlist"},
-        {"raw", "--file", "x", "{}"},
-        {"raw", "--bogus"},
-        {"raw", "[1, 2]"},
-        {"ping", "--count", "0"},
-        {"ping", "--count", "10001"},
-        {"ping", "--count", "3x"},
-        {"ping", "extra"},
+        { "frobnicate" },
+        { "--bogus", "ping" },
+        { "--service" },
+        { "--service=" },
+        { "raw" },
+        { "raw", "{}", "{}" },
+        { "raw", "--file" },
+        { "raw", "--file", m_directory + "/missing.vlist" },
+        { "raw", "--file", "x", "{}" },
+        { "raw", "--bogus" },
+        { "raw", "[1, 2]" },
+        { "ping", "--count", "0" },
+        { "ping", "--count", "10001" },
+        { "ping", "--count", "3x" },
+        { "ping", "extra" },
     };
     for (const auto& arguments : cases) {
         Outcome result = omctl(arguments, m_directory);
@@ -349,8 +350,8 @@ TEST_F(OmctlTest, UsageErrorsExitTwo)
 
 TEST_F(OmctlTest, HelpExitsZeroAndListsOnlyTheAvailableCommands)
 {
-    Outcome main = omctl({"--help"}, m_directory);
-    Outcome raw = omctl({"raw", "--help"}, m_directory);
+    Outcome main = omctl({ "--help" }, m_directory);
+    Outcome raw = omctl({ "raw", "--help" }, m_directory);
 
     EXPECT_EQ(main.status, 0);
     EXPECT_NE(main.out.find("  raw "), std::string::npos);
@@ -369,25 +370,25 @@ TEST_F(OmctlTest, JsonKindsMapOntoTheValueTree)
         "n": {"$real": "-inf"}, "forced": {"$real": 2}, "plain": {"$other": 1}})");
 
     Value expected = Value::dictionary({
-        {"request", "x"},
-        {"i", -5},
-        {"big", std::numeric_limits<int64_t>::max()},
-        {"u", uint64_t {9223372036854775808u}},
-        {"max", std::numeric_limits<uint64_t>::max()},
-        {"min", std::numeric_limits<int64_t>::min()},
-        {"r", 1.5},
-        {"e", 1000.0},
-        {"b", true},
-        {"f", false},
-        {"s", "caf\xC3\xA9 \xF0\x9F\x98\x80\n\""},
-        {"a", Value::array({1, "two", Value::array({}), Value::dictionary({})})},
-        {"id", Value::uuid(*Uuid::parse("6BA7B810-9DAD-11D1-80B4-00C04FD430C8"))},
-        {"d", Value::data(std::vector<uint8_t> {0, 1, 2, 255})},
-        {"t", Value::date(1795341600)},
-        {"t2", Value::date(86400.5)},
-        {"n", -std::numeric_limits<double>::infinity()},
-        {"forced", 2.0},
-        {"plain", Value::dictionary({{"$other", 1}})},
+        { "request", "x" },
+        { "i", -5 },
+        { "big", std::numeric_limits<int64_t>::max() },
+        { "u", uint64_t { 9223372036854775808u } },
+        { "max", std::numeric_limits<uint64_t>::max() },
+        { "min", std::numeric_limits<int64_t>::min() },
+        { "r", 1.5 },
+        { "e", 1000.0 },
+        { "b", true },
+        { "f", false },
+        { "s", "caf\xC3\xA9 \xF0\x9F\x98\x80\n\"" },
+        { "a", Value::array({ 1, "two", Value::array({}), Value::dictionary({}) }) },
+        { "id", Value::uuid(*Uuid::parse("6BA7B810-9DAD-11D1-80B4-00C04FD430C8")) },
+        { "d", Value::data(std::vector<uint8_t> { 0, 1, 2, 255 }) },
+        { "t", Value::date(1795341600) },
+        { "t2", Value::date(86400.5) },
+        { "n", -std::numeric_limits<double>::infinity() },
+        { "forced", 2.0 },
+        { "plain", Value::dictionary({ { "$other", 1 } }) },
     });
     EXPECT_EQ(request, expected) << request.description();
     std::vector<std::string> keys;
@@ -406,28 +407,28 @@ TEST_F(OmctlTest, JsonKindsMapOntoTheValueTree)
 TEST_F(OmctlTest, JsonOutputReadsBackAsTheSameReply)
 {
     Value reply = Value::dictionary({
-        {"errorcode", 0u},
-        {"uuids", Value::uuid(*Uuid::parse("00000000-0000-0000-0000-0000000000FF"))},
-        {"blob", Value::data(std::vector<uint8_t> {0xDE, 0xAD, 0xBE})},
-        {"when", Value::date(1.25)},
-        {"beyondCalendars", Value::date(1e300)},
-        {"nan", std::numeric_limits<double>::quiet_NaN()},
-        {"whole", 3.0},
-        {"tiny", 5e-324},
-        {"negative", std::numeric_limits<int64_t>::min()},
-        {"huge", std::numeric_limits<uint64_t>::max()},
-        {"text", "tab\tquote\"back\\slash\x01\x7F end \xE2\x82\xAC"},
-        {"nested", Value::array({Value::array({}), Value::dictionary({{"k", Value::array({true})}})})},
+        { "errorcode", 0u },
+        { "uuids", Value::uuid(*Uuid::parse("00000000-0000-0000-0000-0000000000FF")) },
+        { "blob", Value::data(std::vector<uint8_t> { 0xDE, 0xAD, 0xBE }) },
+        { "when", Value::date(1.25) },
+        { "beyondCalendars", Value::date(1e300) },
+        { "nan", std::numeric_limits<double>::quiet_NaN() },
+        { "whole", 3.0 },
+        { "tiny", 5e-324 },
+        { "negative", std::numeric_limits<int64_t>::min() },
+        { "huge", std::numeric_limits<uint64_t>::max() },
+        { "text", "tab\tquote\"back\\slash\x01\x7F end \xE2\x82\xAC" },
+        { "nested", Value::array({ Value::array({}), Value::dictionary({ { "k", Value::array({ true }) } }) }) },
     });
     Outcome printed;
     {
         RecordingService service("fake", reply);
-        printed = omctl({"--json", "--service", "fake", "raw", R"({"request": "x"})"}, m_directory);
+        printed = omctl({ "--json", "--service", "fake", "raw", R"({"request": "x"})" }, m_directory);
     }
     ASSERT_EQ(printed.status, 0) << printed.err;
 
     RecordingService echo("fake", kEcho);
-    Outcome fed = omctl({"--service", "fake", "raw", "-"}, m_directory, printed.out);
+    Outcome fed = omctl({ "--service", "fake", "raw", "-" }, m_directory, printed.out);
     ASSERT_EQ(fed.status, 0) << fed.err << printed.out;
     Value readBack = echo.takeRequest();
     // NaN equals nothing, itself included; compare it on its own.
@@ -441,23 +442,25 @@ TEST_F(OmctlTest, JsonOutputReadsBackAsTheSameReply)
 TEST_F(OmctlTest, HumanOutputIsAnIndentedOutline)
 {
     Value reply = Value::dictionary({
-        {"matches", Value::array({Value::dictionary({{"identifier", "com.a"}, {"tags", Value::array({})}}), "x"})},
-        {"empty", Value::dictionary({})},
-        {"padded", " a "},
-        {"blob", Value::data(std::vector<uint8_t> {0x0A, 0xFF})},
+        { "matches",
+            Value::array({ Value::dictionary({ { "identifier", "com.a" }, { "tags", Value::array({}) } }), "x" }) },
+        { "empty", Value::dictionary({}) },
+        { "padded", " a " },
+        { "blob", Value::data(std::vector<uint8_t> { 0x0A, 0xFF }) },
     });
     RecordingService service("fake", reply);
-    Outcome printed = omctl({"--service", "fake", "raw", R"({"request": "x"})"}, m_directory);
+    Outcome printed = omctl({ "--service", "fake", "raw", R"({"request": "x"})" }, m_directory);
 
     EXPECT_EQ(printed.status, 0) << printed.err;
-    EXPECT_EQ(printed.out, "matches:\n"
-                           "  [0]\n"
-                           "    identifier: com.a\n"
-                           "    tags: []\n"
-                           "  [1] x\n"
-                           "empty: {}\n"
-                           "padded: \" a \"\n"
-                           "blob: <2 bytes: 0aff>\n");
+    EXPECT_EQ(printed.out,
+        "matches:\n"
+        "  [0]\n"
+        "    identifier: com.a\n"
+        "    tags: []\n"
+        "  [1] x\n"
+        "empty: {}\n"
+        "padded: \" a \"\n"
+        "blob: <2 bytes: 0aff>\n");
 }
 
 TEST_F(OmctlTest, NestingAtTheLimitIsAcceptedAndOneDeeperRefused)
@@ -477,7 +480,7 @@ TEST_F(OmctlTest, NestingAtTheLimitIsAcceptedAndOneDeeperRefused)
 TEST_F(OmctlTest, HostileNestingFailsCleanly)
 {
     // Through standard input: a single argument of this size would not even reach exec.
-    Outcome result = omctl({"--service", "nobody", "raw", "-"}, m_directory, nested(100000, ""));
+    Outcome result = omctl({ "--service", "nobody", "raw", "-" }, m_directory, nested(100000, ""));
 
     EXPECT_EQ(result.status, 2);
     EXPECT_NE(result.err.find("nesting deeper"), std::string::npos) << result.err;
@@ -494,17 +497,17 @@ TEST_F(OmctlTest, IntegersOutsideSixtyFourBitsAreRefused)
 TEST_F(OmctlTest, MalformedJsonIsRefused)
 {
     const std::vector<std::string> cases = {
-        R"({"s": "\x41"})",        // unknown escape
-        R"({"s": "\u12"})",        // short \u
-        R"({"s": "\ud800"})",      // lone high surrogate
-        R"({"s": "\udc00"})",      // lone low surrogate
+        R"({"s": "\x41"})", // unknown escape
+        R"({"s": "\u12"})", // short \u
+        R"({"s": "\ud800"})", // lone high surrogate
+        R"({"s": "\udc00"})", // lone low surrogate
         R"({"s": "\ud800\u0041"})", // high surrogate with a non-surrogate after it
         R"({"s": "\ud800\ud800"})", // two high surrogates
-        "{\"s\": \"a\x01\"}",      // raw control character
-        "{\"s\": \"\xC3\x28\"}",   // invalid UTF-8
+        "{\"s\": \"a\x01\"}", // raw control character
+        "{\"s\": \"\xC3\x28\"}", // invalid UTF-8
         "{\"s\": \"\xED\xA0\x80\"}", // a surrogate encoded in UTF-8
-        R"({"s": "open)",          // unterminated
-        R"({"n": 01})",            // leading zero
+        R"({"s": "open)", // unterminated
+        R"({"n": 01})", // leading zero
         R"({"n": -})",
         R"({"n": 1.})",
         R"({"n": .5})",
@@ -513,7 +516,7 @@ TEST_F(OmctlTest, MalformedJsonIsRefused)
         R"({"a": [1, 2,]})",
         R"({"a": 1,})",
         R"({"a": 1 "b": 2})",
-        R"({"a": 1, "a": 2})",     // repeated key
+        R"({"a": 1, "a": 2})", // repeated key
         R"({1: 2})",
         R"({"a": 1} trailing)",
         R"({"a": tru})",
@@ -536,7 +539,7 @@ TEST_F(OmctlTest, InputPastTheSizeLimitIsRefused)
 {
     std::string json = R"({"request": "x"})";
     json.resize((16u << 20) + 1, ' ');
-    Outcome result = omctl({"--service", "nobody", "raw", "-"}, m_directory, json);
+    Outcome result = omctl({ "--service", "nobody", "raw", "-" }, m_directory, json);
 
     EXPECT_EQ(result.status, 2);
     EXPECT_NE(result.err.find("longer than"), std::string::npos) << result.err;

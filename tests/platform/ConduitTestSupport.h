@@ -21,7 +21,7 @@
 
 namespace om::test {
 
-inline constexpr std::chrono::seconds kConduitTimeout {30};
+inline constexpr std::chrono::seconds kConduitTimeout { 30 };
 
 // A queue that tests block on: pop() waits for the next item, bounded by a timeout that only a
 // failing test reaches.
@@ -87,9 +87,10 @@ public:
     using RequestHandler = std::function<void(const std::shared_ptr<ConduitConnection>&, const ConduitEvent&)>;
 
     // peerQueue null: the peers' events arrive on the I/O thread.
-    explicit EchoService(std::string name, std::shared_ptr<WorkQueue> peerQueue = nullptr,
-                         RequestHandler onRequest = nullptr)
-        : m_name(std::move(name)), m_shared(std::make_shared<Shared>())
+    explicit EchoService(
+        std::string name, std::shared_ptr<WorkQueue> peerQueue = nullptr, RequestHandler onRequest = nullptr)
+        : m_name(std::move(name))
+        , m_shared(std::make_shared<Shared>())
     {
         m_shared->peerQueue = std::move(peerQueue);
         m_shared->onRequest = std::move(onRequest);
@@ -125,9 +126,9 @@ public:
                     if (shared->onRequest)
                         shared->onRequest(strong, event);
                     else
-                        strong->sendReply(event.requestId, Value::dictionary({{"echo", event.message}}));
+                        strong->sendReply(event.requestId, Value::dictionary({ { "echo", event.message } }));
                 }
-                shared->events.push({strong, event});
+                shared->events.push({ strong, event });
             });
             connection->resume();
         });
@@ -176,7 +177,8 @@ struct TestClient {
     Result<Value> call(const Value& request)
     {
         Mailbox<Result<Value>> outcome;
-        connection->sendWithReply(request, nullptr, [&outcome](Result<Value> result) { outcome.push(std::move(result)); });
+        connection->sendWithReply(
+            request, nullptr, [&outcome](Result<Value> result) { outcome.push(std::move(result)); });
         auto result = outcome.pop();
         if (!result)
             return OMError("Test", 0, "no reply within the timeout");

@@ -22,14 +22,18 @@ using Conduit = ConduitDirectoryTest;
 
 // Signals a mailbox when destroyed: tells a test that a context or a handler was released.
 struct ReleaseSignal {
-    explicit ReleaseSignal(std::shared_ptr<Mailbox<bool>> released) : m_released(std::move(released)) {}
+    explicit ReleaseSignal(std::shared_ptr<Mailbox<bool>> released)
+        : m_released(std::move(released))
+    {
+    }
     ~ReleaseSignal() { m_released->push(true); }
     std::shared_ptr<Mailbox<bool>> m_released;
 };
 
 bool isTransportInvalid(const Result<Value>& result)
 {
-    return !result.ok() && result.error() == OMError(kConduitErrorDomain, kConduitConnectionInvalid, "Connection invalid");
+    return !result.ok()
+        && result.error() == OMError(kConduitErrorDomain, kConduitConnectionInvalid, "Connection invalid");
 }
 
 TEST_F(Conduit, ConcurrentRequestsEachGetTheirOwnReply)
@@ -49,9 +53,10 @@ TEST_F(Conduit, ConcurrentRequestsEachGetTheirOwnReply)
                 const int n = t * kPerThread + i;
                 // Half the replies come on a queue, half on the I/O thread.
                 auto queue = n % 2 ? replyQueue : nullptr;
-                client.connection->sendWithReply(Value::dictionary({{"n", n}}), queue, [&outcomes, n](Result<Value> reply) {
-                    outcomes.push(reply.ok() && reply.value()["echo"]["n"] == Value(n));
-                });
+                client.connection->sendWithReply(
+                    Value::dictionary({ { "n", n } }), queue, [&outcomes, n](Result<Value> reply) {
+                        outcomes.push(reply.ok() && reply.value()["echo"]["n"] == Value(n));
+                    });
             }
         });
     }
@@ -75,8 +80,8 @@ TEST_F(Conduit, EventsArriveInOrderAndInvalidComesOnceAndLast)
 
     constexpr int kMessages = 500;
     for (int i = 0; i < kMessages; ++i)
-        client.connection->send(Value::dictionary({{"seq", i}}));
-    ASSERT_TRUE(client.call(Value::dictionary({{"last", true}})).ok());
+        client.connection->send(Value::dictionary({ { "seq", i } }));
+    ASSERT_TRUE(client.call(Value::dictionary({ { "last", true } })).ok());
     client.connection->cancel();
 
     std::vector<ConduitEvent> seen;
@@ -123,15 +128,16 @@ TEST_F(Conduit, OutstandingRequestsFailWhenThePeerCloses)
 {
     // The service closes each connection on its first request instead of answering.
     EchoService service("com.test.closer", nullptr,
-                        [](const std::shared_ptr<ConduitConnection>& connection, const ConduitEvent&) { connection->cancel(); });
+        [](const std::shared_ptr<ConduitConnection>& connection, const ConduitEvent&) { connection->cancel(); });
     ASSERT_TRUE(service.start());
     TestClient client(service.name());
     auto replyQueue = WorkQueue::create("test.replies");
     Mailbox<bool> failures;
     for (int i = 0; i < 3; ++i) {
-        client.connection->sendWithReply(Value::dictionary({{"n", i}}), replyQueue, [&failures, replyQueue](Result<Value> result) {
-            failures.push(isTransportInvalid(result) && replyQueue->isCurrent());
-        });
+        client.connection->sendWithReply(
+            Value::dictionary({ { "n", i } }), replyQueue, [&failures, replyQueue](Result<Value> result) {
+                failures.push(isTransportInvalid(result) && replyQueue->isCurrent());
+            });
     }
     for (int i = 0; i < 3; ++i) {
         auto failure = failures.pop();
@@ -147,12 +153,11 @@ TEST_F(Conduit, RequestOnAnInvalidConnectionFailsOnItsQueue)
     EXPECT_EQ(client.events->pop()->kind, ConduitEvent::Kind::ConnectionInvalid);
     auto queue = WorkQueue::create("test.replies");
     Mailbox<bool> failure;
-    client.connection->sendWithReply(Value::dictionary({}), queue, [&failure, queue](Result<Value> result) {
-        failure.push(isTransportInvalid(result) && queue->isCurrent());
-    });
+    client.connection->sendWithReply(Value::dictionary({}), queue,
+        [&failure, queue](Result<Value> result) { failure.push(isTransportInvalid(result) && queue->isCurrent()); });
     EXPECT_TRUE(failure.pop().value_or(false));
-    client.connection->send(Value::dictionary({}));            // dropped, no crash
-    client.connection->sendReply(7, Value::dictionary({}));    // dropped, no crash
+    client.connection->send(Value::dictionary({})); // dropped, no crash
+    client.connection->sendReply(7, Value::dictionary({})); // dropped, no crash
     EXPECT_EQ(client.events->size(), 0u);
 }
 
@@ -163,7 +168,8 @@ TEST_F(Conduit, MissingServiceBecomesInvalidOnlyOnceResumed)
     connection->setEventHandler([&events](const ConduitEvent& event) { events.push(event); });
     Mailbox<bool> failure;
     // Sent before resume: fails all the same.
-    connection->sendWithReply(Value::dictionary({}), nullptr, [&failure](Result<Value> r) { failure.push(isTransportInvalid(r)); });
+    connection->sendWithReply(
+        Value::dictionary({}), nullptr, [&failure](Result<Value> r) { failure.push(isTransportInvalid(r)); });
     EXPECT_TRUE(failure.pop().value_or(false));
     EXPECT_EQ(events.size(), 0u);
     connection->resume();
@@ -173,7 +179,7 @@ TEST_F(Conduit, MissingServiceBecomesInvalidOnlyOnceResumed)
 
 TEST_F(Conduit, InvalidServiceNamesAreRefused)
 {
-    for (const char* name : {"", ".", "..", "a/b", "../escape"}) {
+    for (const char* name : { "", ".", "..", "a/b", "../escape" }) {
         auto listener = ConduitListener::create(name, nullptr);
         EXPECT_FALSE(listener.ok()) << name;
         TestClient client(name);
@@ -195,7 +201,7 @@ TEST_F(Conduit, StaleSocketIsReplaced)
     EchoService service("com.test.stale");
     ASSERT_TRUE(service.start());
     TestClient client(service.name());
-    EXPECT_TRUE(client.call(Value::dictionary({{"hello", 1}})).ok());
+    EXPECT_TRUE(client.call(Value::dictionary({ { "hello", 1 } })).ok());
 }
 
 TEST_F(Conduit, SecondLiveListenerIsRefusedUntilTheFirstGoes)
@@ -208,7 +214,7 @@ TEST_F(Conduit, SecondLiveListenerIsRefusedUntilTheFirstGoes)
     EXPECT_NE(second.error().localizedDescription().find(om::Conduit::socketPath("com.test.owned")), std::string::npos)
         << second.error().localizedDescription();
 
-    first.value().reset();  // unlinks its socket
+    first.value().reset(); // unlinks its socket
     auto third = ConduitListener::create("com.test.owned", nullptr);
     EXPECT_TRUE(third.ok());
 }
@@ -233,7 +239,12 @@ TEST_F(Conduit, ListenerMakesItsDirectoryAndAnOpenSocket)
     EXPECT_EQ(listener.value()->socketPath(), nested + "/com.test.modes");
     struct stat info;
     ASSERT_EQ(::stat(nested.c_str(), &info), 0);
-    EXPECT_EQ(info.st_mode & 07777, 0755u & ~[] { mode_t m = ::umask(0); ::umask(m); return m; }());
+    EXPECT_EQ(
+        info.st_mode & 07777, 0755u & ~[] {
+            mode_t m = ::umask(0);
+            ::umask(m);
+            return m;
+        }());
     ASSERT_EQ(::stat(listener.value()->socketPath().c_str(), &info), 0);
     EXPECT_TRUE(S_ISSOCK(info.st_mode));
     EXPECT_EQ(info.st_mode & 0777, 0666u);
@@ -259,12 +270,12 @@ TEST_F(Conduit, NonDictionaryPayloadsAreDeliveredAsMessages)
     ASSERT_TRUE(service.start());
     auto peer = RawConduitPeer::connectToService(service.name());
     ASSERT_TRUE(peer);
-    ASSERT_TRUE(peer->sendFrame(RawConduitPeer::kMessage, 0, Value::array({1, 2})));
+    ASSERT_TRUE(peer->sendFrame(RawConduitPeer::kMessage, 0, Value::array({ 1, 2 })));
     ASSERT_TRUE(peer->sendFrame(RawConduitPeer::kRequest, 1, Value("text")));
 
     auto first = service.events().pop();
     ASSERT_TRUE(first);
-    EXPECT_EQ(first->event.message, Value::array({1, 2}));
+    EXPECT_EQ(first->event.message, Value::array({ 1, 2 }));
     EXPECT_FALSE(first->event.expectsReply());
     auto second = service.events().pop();
     ASSERT_TRUE(second);
@@ -287,7 +298,7 @@ TEST_F(Conduit, TerminationImminentIsAnEventAndChangesNothingElse)
     ASSERT_TRUE(event);
     EXPECT_EQ(event->event.kind, ConduitEvent::Kind::TerminationImminent);
 
-    ASSERT_TRUE(peer->sendFrame(RawConduitPeer::kRequest, 1, Value::dictionary({{"still", "here"}})));
+    ASSERT_TRUE(peer->sendFrame(RawConduitPeer::kRequest, 1, Value::dictionary({ { "still", "here" } })));
     auto reply = peer->readFrame();
     ASSERT_TRUE(reply);
     EXPECT_EQ(reply->value["echo"]["still"], Value("here"));
@@ -312,7 +323,7 @@ TEST_F(Conduit, ContextLivesExactlyAsLongAsTheConnection)
     client->connection->cancel();
     EXPECT_EQ(client->events->pop()->kind, ConduitEvent::Kind::ConnectionInvalid);
     EXPECT_EQ(released->size(), 1u);
-    client.reset();  // the last reference outside the transport
+    client.reset(); // the last reference outside the transport
     EXPECT_TRUE(released->pop());
     EXPECT_TRUE(released->pop());
 }
@@ -329,22 +340,22 @@ void expectHandlerMayDropTheLastReference(std::shared_ptr<WorkQueue> peerQueue)
         struct Record {
             std::shared_ptr<ConduitConnection> connection;
         };
-        auto record = std::make_shared<Record>(Record {connection});
+        auto record = std::make_shared<Record>(Record { connection });
         connection->setContext(std::make_shared<ReleaseSignal>(released));
         connection->setTargetQueue(peerQueue);
         connection->setEventHandler([record](const ConduitEvent& event) {
             if (event.expectsReply())
                 record->connection->sendReply(event.requestId, Value::dictionary({}));
             if (event.kind == ConduitEvent::Kind::ConnectionInvalid)
-                record->connection.reset();  // from here on only the transport's own reference remains
+                record->connection.reset(); // from here on only the transport's own reference remains
         });
         connection->resume();
     });
     listener.value()->resume();
     {
         TestClient client("com.test.selfdrop");
-        ASSERT_TRUE(client.call(Value::dictionary({{"x", 1}})).ok());
-    }  // the client closes; the peer connection ends
+        ASSERT_TRUE(client.call(Value::dictionary({ { "x", 1 } })).ok());
+    } // the client closes; the peer connection ends
     EXPECT_TRUE(released->pop()) << "the peer connection was never destroyed";
 }
 
@@ -366,9 +377,10 @@ TEST_F(Conduit, PeerThatStopsReadingIsDisconnectedAlone)
     } limit;
     Log::Capture capture;
     const Value blob = Value::data(std::vector<uint8_t>(64 * 1024, 0x5a));
-    EchoService service("com.test.slow", nullptr, [blob](const std::shared_ptr<ConduitConnection>& connection, const ConduitEvent& event) {
-        connection->sendReply(event.requestId, Value::dictionary({{"blob", blob}}));
-    });
+    EchoService service("com.test.slow", nullptr,
+        [blob](const std::shared_ptr<ConduitConnection>& connection, const ConduitEvent& event) {
+            connection->sendReply(event.requestId, Value::dictionary({ { "blob", blob } }));
+        });
     ASSERT_TRUE(service.start());
     TestClient healthy(service.name());
     ASSERT_TRUE(healthy.call(Value::dictionary({})).ok());
@@ -377,13 +389,12 @@ TEST_F(Conduit, PeerThatStopsReadingIsDisconnectedAlone)
     ASSERT_TRUE(sleeper);
     // Sending stops making sense once the service has dropped us, which may come early.
     ASSERT_TRUE(sleeper->sendFrame(RawConduitPeer::kRequest, 1, Value::dictionary({})));
-    for (uint64_t id = 2; id <= 64 && sleeper->sendFrame(RawConduitPeer::kRequest, id, Value::dictionary({})); ++id) {
-    }
+    for (uint64_t id = 2; id <= 64 && sleeper->sendFrame(RawConduitPeer::kRequest, id, Value::dictionary({})); ++id) { }
     // The sleeper reads nothing until the service has given up on it.
     EXPECT_TRUE(capture.waitUntil([](const std::vector<Log::Record>& records) {
         return std::any_of(records.begin(), records.end(), [](const Log::Record& record) {
-            return record.message.find("peer stopped reading") != std::string::npos &&
-                   record.message.find("pid " + std::to_string(::getpid())) != std::string::npos;
+            return record.message.find("peer stopped reading") != std::string::npos
+                && record.message.find("pid " + std::to_string(::getpid())) != std::string::npos;
         });
     }));
     EXPECT_TRUE(sleeper->waitForClose());
@@ -399,12 +410,12 @@ TEST_F(Conduit, UnsendableValuesAreRefusedAtTheSender)
     TestClient client(service.name());
     Value deep = Value(1);
     for (int i = 0; i < 129; ++i)
-        deep = Value::array({deep});
+        deep = Value::array({ deep });
     auto refused = client.call(deep);
     ASSERT_FALSE(refused.ok());
     EXPECT_NE(refused.error().domain(), kConduitErrorDomain);
     // The connection is untouched by the refusal.
-    EXPECT_TRUE(client.call(Value::dictionary({{"fine", true}})).ok());
+    EXPECT_TRUE(client.call(Value::dictionary({ { "fine", true } })).ok());
 }
 
 // SIGTERM: every peer hears "termination imminent", and the process exits with 0 only once the
@@ -429,7 +440,7 @@ void runTerminationScenario()
     if (!frame || frame->kind != RawConduitPeer::kTerminationImminent || !frame->payload.empty())
         std::_Exit(5);
     std::fprintf(stderr, "peer heard termination imminent\n");
-    delete keepAlive;  // the I/O thread exits now
+    delete keepAlive; // the I/O thread exits now
     for (;;)
         ::pause();
 }
@@ -444,31 +455,32 @@ TEST(ValueTreeConversion, SharesWhatCanTravelAndRefusesTheRest)
 {
     Value nested = Value(1);
     for (int i = 0; i < 127; ++i)
-        nested = Value::array({nested});
-    const Value at128 = Value::dictionary({{"k", nested}});
+        nested = Value::array({ nested });
+    const Value at128 = Value::dictionary({ { "k", nested } });
     EXPECT_EQ(ValueTreeConversion::toConduit(at128), at128);
     EXPECT_EQ(ValueTreeConversion::fromConduit(at128), at128);
-    const Value at129 = Value::array({at128});
+    const Value at129 = Value::array({ at128 });
     EXPECT_FALSE(ValueTreeConversion::toConduit(at129));
     EXPECT_FALSE(ValueTreeConversion::fromConduit(at129));
 
     EXPECT_FALSE(ValueTreeConversion::toConduit(Value()));
-    EXPECT_FALSE(ValueTreeConversion::toConduit(Value::array({1, Value()})));
-    EXPECT_FALSE(ValueTreeConversion::toConduit(Value::dictionary({{"a", Value::array({Value()})}})));
+    EXPECT_FALSE(ValueTreeConversion::toConduit(Value::array({ 1, Value() })));
+    EXPECT_FALSE(ValueTreeConversion::toConduit(Value::dictionary({ { "a", Value::array({ Value() }) } })));
     EXPECT_FALSE(ValueTreeConversion::toConduit(Value::string("bad \xff utf-8")));
-    EXPECT_FALSE(ValueTreeConversion::toConduit(Value::dictionary({{"\xc0\x80", 1}})));
-    EXPECT_TRUE(ValueTreeConversion::toConduit(Value::dictionary({{"caf\xc3\xa9", Value::uuid(Uuid())}})));
+    EXPECT_FALSE(ValueTreeConversion::toConduit(Value::dictionary({ { "\xc0\x80", 1 } })));
+    EXPECT_TRUE(ValueTreeConversion::toConduit(Value::dictionary({ { "caf\xc3\xa9", Value::uuid(Uuid()) } })));
 }
 
 TEST(ConduitMessageEncoding, CarriesATreeAsOneDataValue)
 {
-    const Value tree = Value::dictionary({{"a", Value::array({1, "two", 3.5, true})}, {"d", Value::date(86400)}});
+    const Value tree
+        = Value::dictionary({ { "a", Value::array({ 1, "two", 3.5, true }) }, { "d", Value::date(86400) } });
     const Value encoded = ConduitMessageEncoding::encode(tree);
     ASSERT_TRUE(encoded.isData());
     EXPECT_EQ(ConduitMessageEncoding::decode(encoded), tree);
     EXPECT_FALSE(ConduitMessageEncoding::decode(tree));
-    EXPECT_FALSE(ConduitMessageEncoding::decode(Value::data(std::vector<uint8_t> {0xa1, 0x61})));
-    EXPECT_FALSE(ConduitMessageEncoding::decode(ConduitMessageEncoding::encode(Value::array({Value()}))));
+    EXPECT_FALSE(ConduitMessageEncoding::decode(Value::data(std::vector<uint8_t> { 0xa1, 0x61 })));
+    EXPECT_FALSE(ConduitMessageEncoding::decode(ConduitMessageEncoding::encode(Value::array({ Value() }))));
 }
 
 } // namespace

@@ -1,6 +1,5 @@
-#include <gtest/gtest.h>
-
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <poll.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
@@ -52,7 +51,7 @@ struct Child {
             ::_exit(0);
         }
         ::close(pipeFds[0]);
-        return Child {pid, UniqueFd(pipeFds[1])};
+        return Child { pid, UniqueFd(pipeFds[1]) };
     }
     void finish()
     {
@@ -102,13 +101,15 @@ TEST(Process, SelfRunsItsOwnExecutableUnsandboxed)
     ASSERT_TRUE(file.ok());
     char magic[4];
     ASSERT_EQ(::pread(file->get(), magic, sizeof magic, 0), ssize_t(sizeof magic));
-    EXPECT_EQ(std::string(magic, 4), "\x7f" "ELF");
+    EXPECT_EQ(std::string(magic, 4),
+        "\x7f"
+        "ELF");
     EXPECT_TRUE(::fcntl(file->get(), F_GETFD) & FD_CLOEXEC);
 }
 
 TEST(Process, TokenWithoutPidfdStillAnswers)
 {
-    AuditToken bare {::getpid(), ::geteuid(), ::getegid(), nullptr};
+    AuditToken bare { ::getpid(), ::geteuid(), ::getegid(), nullptr };
     EXPECT_TRUE(Process::isAlive(bare));
     auto path = Process::executablePath(bare);
     ASSERT_TRUE(path.ok());
@@ -137,7 +138,7 @@ TEST(Process, ExitedChildIsNotAliveEvenBeforeItIsReaped)
     ASSERT_TRUE(token.pidfd);
     child.release.reset();
     // A pidfd turns readable when its process exits; the child is a zombie from then on.
-    pollfd exited {token.pidfd->get(), POLLIN, 0};
+    pollfd exited { token.pidfd->get(), POLLIN, 0 };
     ASSERT_EQ(::poll(&exited, 1, 30000), 1);
     EXPECT_FALSE(Process::isAlive(token));
     EXPECT_FALSE(Process::executablePath(token).ok());

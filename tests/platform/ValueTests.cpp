@@ -57,7 +57,7 @@ TEST(Value, IntegerReadsRespectRange)
 
 TEST(Value, DictionaryKeepsInsertionOrder)
 {
-    Value d = Value::dictionary({{"zeta", 1}, {"alpha", 2}, {"mid", 3}});
+    Value d = Value::dictionary({ { "zeta", 1 }, { "alpha", 2 }, { "mid", 3 } });
     ASSERT_EQ(d.count(), 3u);
     EXPECT_EQ(d.entries()[0].first, "zeta");
     EXPECT_EQ(d.entries()[1].first, "alpha");
@@ -68,8 +68,8 @@ TEST(Value, DictionaryKeepsInsertionOrder)
 
 TEST(Value, RepeatedKeyKeepsFirstPositionAndLastValue)
 {
-    for (size_t filler : {0u, 20u}) {  // small (linear) and large (indexed) dictionaries
-        std::vector<Value::Entry> entries {{"a", 1}, {"b", 2}};
+    for (size_t filler : { 0u, 20u }) { // small (linear) and large (indexed) dictionaries
+        std::vector<Value::Entry> entries { { "a", 1 }, { "b", 2 } };
         for (size_t i = 0; i < filler; ++i)
             entries.emplace_back("k" + std::to_string(i), Value(int(i)));
         entries.emplace_back("a", 9);
@@ -83,7 +83,7 @@ TEST(Value, RepeatedKeyKeepsFirstPositionAndLastValue)
 TEST(Value, UniqueDictionaryNamesTheRepeatedKey)
 {
     std::string duplicate;
-    EXPECT_FALSE(Value::uniqueDictionary({{"x", 1}, {"y", 2}, {"x", 3}}, &duplicate));
+    EXPECT_FALSE(Value::uniqueDictionary({ { "x", 1 }, { "y", 2 }, { "x", 3 } }, &duplicate));
     EXPECT_EQ(duplicate, "x");
 
     std::vector<Value::Entry> many;
@@ -114,16 +114,17 @@ TEST(Value, LargeDictionaryLookupFindsEveryKey)
 
 TEST(Value, DictionariesCompareAsMaps)
 {
-    EXPECT_EQ(Value::dictionary({{"a", 1}, {"b", 2}}), Value::dictionary({{"b", 2}, {"a", true}}));
-    EXPECT_NE(Value::dictionary({{"a", 1}}), Value::dictionary({{"a", 1}, {"b", 2}}));
-    EXPECT_NE(Value::dictionary({{"a", 1}, {"b", 2}}), Value::dictionary({{"a", 1}, {"c", 2}}));
-    EXPECT_EQ(Value::dictionary({{"a", 1}, {"b", 2}}).hash(), Value::dictionary({{"b", 2}, {"a", 1}}).hash());
-    EXPECT_NE(Value::array({1, 2}), Value::array({2, 1}));
+    EXPECT_EQ(Value::dictionary({ { "a", 1 }, { "b", 2 } }), Value::dictionary({ { "b", 2 }, { "a", true } }));
+    EXPECT_NE(Value::dictionary({ { "a", 1 } }), Value::dictionary({ { "a", 1 }, { "b", 2 } }));
+    EXPECT_NE(Value::dictionary({ { "a", 1 }, { "b", 2 } }), Value::dictionary({ { "a", 1 }, { "c", 2 } }));
+    EXPECT_EQ(
+        Value::dictionary({ { "a", 1 }, { "b", 2 } }).hash(), Value::dictionary({ { "b", 2 }, { "a", 1 } }).hash());
+    EXPECT_NE(Value::array({ 1, 2 }), Value::array({ 2, 1 }));
 }
 
 TEST(Value, CopiesShareAndBuildersDoNotDisturbTheOriginal)
 {
-    Value original = Value::dictionary({{"inner", Value::array({"x"})}, {"n", 1}});
+    Value original = Value::dictionary({ { "inner", Value::array({ "x" }) }, { "n", 1 } });
     Value copy = original;
     Value changed = DictionaryBuilder(original).set("n", 2).set("added", "y").remove("inner").build();
     EXPECT_EQ(original["n"], Value(1));
@@ -138,7 +139,7 @@ TEST(Value, CopiesShareAndBuildersDoNotDisturbTheOriginal)
 
     Value appended = ArrayBuilder(original["inner"]).append("z").build();
     EXPECT_EQ(original["inner"].count(), 1u);
-    EXPECT_EQ(appended, Value::array({"x", "z"}));
+    EXPECT_EQ(appended, Value::array({ "x", "z" }));
 }
 
 TEST(Value, WrongKindReadsGiveNone)
@@ -149,28 +150,28 @@ TEST(Value, WrongKindReadsGiveNone)
     EXPECT_TRUE(s.elements().empty());
     EXPECT_EQ(s.count(), 0u);
     EXPECT_EQ(s.asData(), nullptr);
-    EXPECT_TRUE(Value::array({1}).at(1).isNone());
+    EXPECT_TRUE(Value::array({ 1 }).at(1).isNone());
 }
 
 TEST(Value, DescriptionShowsEveryKind)
 {
     Uuid u = *Uuid::parse("00112233-4455-6677-8899-aabbccddeeff");
     Value d = Value::dictionary({
-        {"s", "a\"b"},
-        {"i", -4},
-        {"u", std::numeric_limits<uint64_t>::max()},
-        {"r", 2.5},
-        {"b", true},
-        {"data", Value::data(std::vector<uint8_t> {0x0a, 0xff})},
-        {"date", Value::date(1795341600)},
-        {"uuid", Value::uuid(u)},
-        {"list", Value::array({1, "x"})},
-        {"empty", Value::dictionary({})},
+        { "s", "a\"b" },
+        { "i", -4 },
+        { "u", std::numeric_limits<uint64_t>::max() },
+        { "r", 2.5 },
+        { "b", true },
+        { "data", Value::data(std::vector<uint8_t> { 0x0a, 0xff }) },
+        { "date", Value::date(1795341600) },
+        { "uuid", Value::uuid(u) },
+        { "list", Value::array({ 1, "x" }) },
+        { "empty", Value::dictionary({}) },
     });
     EXPECT_EQ(d.description(),
-              "{\"s\" = \"a\\\"b\"; \"i\" = -4; \"u\" = 18446744073709551615; \"r\" = 2.5; \"b\" = true; "
-              "\"data\" = <0aff>; \"date\" = 2026-11-22T10:00:00Z; "
-              "\"uuid\" = 00112233-4455-6677-8899-AABBCCDDEEFF; \"list\" = (1, \"x\"); \"empty\" = {}}");
+        "{\"s\" = \"a\\\"b\"; \"i\" = -4; \"u\" = 18446744073709551615; \"r\" = 2.5; \"b\" = true; "
+        "\"data\" = <0aff>; \"date\" = 2026-11-22T10:00:00Z; "
+        "\"uuid\" = 00112233-4455-6677-8899-AABBCCDDEEFF; \"list\" = (1, \"x\"); \"empty\" = {}}");
     EXPECT_EQ(Value("plain").description(), "plain");
     EXPECT_EQ(Value().description(), "(none)");
 }
@@ -202,10 +203,10 @@ TEST(Uuid, ParsesEitherCaseAndPrintsUpperCase)
 
 TEST(Uuid, RefusesEverythingButTheCanonicalShape)
 {
-    for (const char* bad : {"", "0A1B2C3D4E5F607182 93A4B5C6D7E8F9", "0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F",
-                            "0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F90", "0A1B2C3D-4E5F-6071-8293_A4B5C6D7E8F9",
-                            "0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8G9", "{A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F9}",
-                            "0A1B2C3-D4E5F-6071-8293-A4B5C6D7E8F9", "0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F "}) {
+    for (const char* bad : { "", "0A1B2C3D4E5F607182 93A4B5C6D7E8F9", "0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F",
+             "0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F90", "0A1B2C3D-4E5F-6071-8293_A4B5C6D7E8F9",
+             "0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8G9", "{A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F9}",
+             "0A1B2C3-D4E5F-6071-8293-A4B5C6D7E8F9", "0A1B2C3D-4E5F-6071-8293-A4B5C6D7E8F " }) {
         EXPECT_FALSE(Uuid::parse(bad)) << bad;
     }
 }

@@ -80,10 +80,11 @@ bool RawConduitPeer::receive(std::chrono::steady_clock::time_point deadline)
     if (m_closed)
         return false;
     for (;;) {
-        const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
+        const auto left
+            = std::chrono::duration_cast<std::chrono::milliseconds>(deadline - std::chrono::steady_clock::now());
         if (left.count() <= 0)
             return false;
-        pollfd entry {m_socket.get(), POLLIN, 0};
+        pollfd entry { m_socket.get(), POLLIN, 0 };
         const int ready = ::poll(&entry, 1, int(left.count()));
         if (ready < 0 && errno == EINTR)
             continue;

@@ -38,8 +38,8 @@ public:
     struct Frame {
         uint8_t kind = 0;
         uint64_t id = 0;
-        std::vector<uint8_t> payload;  // the raw payload bytes
-        om::Value value;               // the decoded payload; none when empty or undecodable
+        std::vector<uint8_t> payload; // the raw payload bytes
+        om::Value value; // the decoded payload; none when empty or undecodable
     };
 
     // None when nothing accepts connections there.
@@ -70,7 +70,10 @@ public:
     static std::vector<uint8_t> frame(uint8_t kind, uint64_t id, std::span<const uint8_t> payload);
 
 private:
-    explicit RawConduitPeer(om::UniqueFd socket) : m_socket(std::move(socket)) {}
+    explicit RawConduitPeer(om::UniqueFd socket)
+        : m_socket(std::move(socket))
+    {
+    }
     // Reads more bytes into m_buffer; false on close or timeout.
     bool receive(std::chrono::steady_clock::time_point deadline);
 

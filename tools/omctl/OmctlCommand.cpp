@@ -13,9 +13,9 @@ namespace om {
 namespace {
 
 const OmctlCommand::Entry kCommands[] = {
-    {"raw", "send a request dictionary (vlist file or JSON) and print the reply", OmctlDiagnostics::kRawHelp,
-     OmctlDiagnostics::raw},
-    {"ping", "check that omd answers, with the round-trip time", OmctlDiagnostics::kPingHelp, OmctlDiagnostics::ping},
+    { "raw", "send a request dictionary (vlist file or JSON) and print the reply", OmctlDiagnostics::kRawHelp,
+        OmctlDiagnostics::raw },
+    { "ping", "check that omd answers, with the round-trip time", OmctlDiagnostics::kPingHelp, OmctlDiagnostics::ping },
 };
 
 bool isHelp(std::string_view argument)
@@ -80,7 +80,7 @@ int OmctlCommand::run(const std::vector<std::string>& arguments, std::istream& i
         return usage("no command given");
 
     auto entry = std::find_if(commands().begin(), commands().end(),
-                              [&](const Entry& candidate) { return candidate.name == arguments[index]; });
+        [&](const Entry& candidate) { return candidate.name == arguments[index]; });
     if (entry == commands().end())
         return usage("unknown command " + arguments[index]);
 

@@ -18,8 +18,8 @@ public:
 
     struct Entry {
         std::string_view name;
-        std::string_view summary;  // one line for the command list
-        const char* help;          // the full text of "omctl <name> --help"
+        std::string_view summary; // one line for the command list
+        const char* help; // the full text of "omctl <name> --help"
         Handler handler;
     };
 

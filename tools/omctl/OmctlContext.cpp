@@ -53,7 +53,7 @@ int OmctlContext::outcome(const Result<Value>& reply)
         bool listening = std::filesystem::exists(socketPath(), ignored);
         // One write per message: the library may log to stderr from its own thread meanwhile.
         m_err << format("omctl: cannot reach omd at %s: %s%s\n", socketPath(), reply.error().localizedDescription(),
-                        listening ? "" : " (no socket there)");
+            listening ? "" : " (no socket there)");
         return kOmctlUnreachable;
     }
     // The library treats a message without a code as a broken daemon and aborts; a diagnostic

@@ -15,9 +15,9 @@ namespace om {
 
 enum OmctlExitStatus : int {
     kOmctlSuccess = 0,
-    kOmctlDaemonError = 1,  // omd answered with an error
-    kOmctlUsage = 2,        // bad command line or unreadable input
-    kOmctlUnreachable = 3,  // no answer: the transport failed
+    kOmctlDaemonError = 1, // omd answered with an error
+    kOmctlUsage = 2, // bad command line or unreadable input
+    kOmctlUnreachable = 3, // no answer: the transport failed
 };
 
 class OmctlContext {

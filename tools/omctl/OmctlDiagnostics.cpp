@@ -3,8 +3,8 @@
 #include <charconv>
 #include <chrono>
 #include <cstdio>
-#include <optional>
 #include <istream>
+#include <optional>
 #include <ostream>
 
 #include "platform/ValueTreeConversion.h"
@@ -48,7 +48,7 @@ namespace {
 
 // Takes the value of an option given as "--name VALUE" or "--name=VALUE".
 std::optional<std::string> optionValue(const std::vector<std::string>& arguments, size_t& index,
-                                       std::string_view longName, std::string_view shortName, bool& matched)
+    std::string_view longName, std::string_view shortName, bool& matched)
 {
     const std::string& argument = arguments[index];
     matched = false;
@@ -108,8 +108,8 @@ int OmctlDiagnostics::raw(OmctlContext& context, const std::vector<std::string>&
         request = OmctlJson::parse(texts.front());
     }
     if (!request.ok()) {
-        return context.usage("raw: " + (file ? *file : std::string("JSON request")) + ": "
-                             + request.error().localizedDescription());
+        return context.usage(
+            "raw: " + (file ? *file : std::string("JSON request")) + ": " + request.error().localizedDescription());
     }
     if (!request->isDictionary())
         return context.usage("raw: the request must be a dictionary");
@@ -155,9 +155,9 @@ int OmctlDiagnostics::ping(OmctlContext& context, const std::vector<std::string>
     }
     if (context.json()) {
         context.print(Value::dictionary({
-            {"service", Value::string(context.service())},
-            {"socket", Value::string(context.socketPath())},
-            {"roundTripMilliseconds", times.build()},
+            { "service", Value::string(context.service()) },
+            { "socket", Value::string(context.socketPath()) },
+            { "roundTripMilliseconds", times.build() },
         }));
     }
     return kOmctlSuccess;

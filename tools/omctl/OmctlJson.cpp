@@ -69,7 +69,9 @@ void writeString(std::string& out, std::string_view text)
 void writeReal(std::string& out, double value)
 {
     if (!std::isfinite(value)) {
-        out += std::isnan(value) ? "{\"$real\": \"nan\"}" : value > 0 ? "{\"$real\": \"inf\"}" : "{\"$real\": \"-inf\"}";
+        out += std::isnan(value) ? "{\"$real\": \"nan\"}"
+            : value > 0          ? "{\"$real\": \"inf\"}"
+                                 : "{\"$real\": \"-inf\"}";
         return;
     }
     char buffer[64];
@@ -186,8 +188,8 @@ Result<Value> OmctlJson::parse(std::string_view text)
     Value value;
     parser.skipSpace();
     if (!parser.parseValue(value, 0))
-        return OMError::platform(parser.m_error.starts_with("nesting") ? kPlatformErrorLimit : kPlatformErrorMalformed,
-                                 parser.m_error);
+        return OMError::platform(
+            parser.m_error.starts_with("nesting") ? kPlatformErrorLimit : kPlatformErrorMalformed, parser.m_error);
     parser.skipSpace();
     if (parser.m_position != text.size()) {
         parser.fail("unexpected text after the value", parser.m_position);
@@ -312,9 +314,9 @@ bool OmctlJson::applyMarker(Value& out, const std::string& key, const Value& arg
             return fail("\"$data\" needs base64 text", start);
         out = Value::data(std::move(*bytes));
     } else if (key == "$date") {
-        auto seconds = text                                          ? VlistText::parseDate(*text)
-                       : argument.isInteger() || argument.isReal() ? argument.asDouble()
-                                                                   : std::nullopt;
+        auto seconds = text                             ? VlistText::parseDate(*text)
+            : argument.isInteger() || argument.isReal() ? argument.asDouble()
+                                                        : std::nullopt;
         if (!seconds)
             return fail("\"$date\" needs ISO 8601 UTC text or seconds since 1970", start);
         out = Value::date(*seconds);
@@ -332,7 +334,7 @@ bool OmctlJson::applyMarker(Value& out, const std::string& key, const Value& arg
             return fail("\"$real\" needs a number, \"nan\", \"inf\" or \"-inf\"", start);
         out = Value::real(*real);
     } else {
-        out = Value::dictionary({{key, argument}});
+        out = Value::dictionary({ { key, argument } });
     }
     return true;
 }

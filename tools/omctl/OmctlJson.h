@@ -35,7 +35,10 @@ public:
     static std::string write(const Value& value);
 
 private:
-    explicit OmctlJson(std::string_view text) : m_text(text) {}
+    explicit OmctlJson(std::string_view text)
+        : m_text(text)
+    {
+    }
 
     bool parseValue(Value& out, size_t depth);
     bool parseObject(Value& out, size_t depth);

@@ -19,7 +19,8 @@ bool isEmptyContainer(const Value& value)
 std::string displayText(const std::string& text)
 {
     bool bare = !text.empty() && text.front() != ' ' && text.back() != ' '
-        && std::none_of(text.begin(), text.end(), [](char c) { return static_cast<unsigned char>(c) < 0x20 || c == '"'; });
+        && std::none_of(
+            text.begin(), text.end(), [](char c) { return static_cast<unsigned char>(c) < 0x20 || c == '"'; });
     if (bare)
         return text;
     std::string out = "\"";
