@@ -259,8 +259,8 @@ TEST(VlistXmlReader, RefusalsNameTheLine)
 
 TEST(VlistXmlReader, DocumentShapeIsChecked)
 {
-    EXPECT_EQ(refusal("<?xml version=\"1.0\"?>\n<plist version=\"1\"><true/></plist>\n"),
-        "line 2: root element <plist> is not <vlist>");
+    EXPECT_EQ(refusal("<?xml version=\"1.0\"?>\n<config version=\"1\"><true/></config>\n"),
+        "line 2: root element <config> is not <vlist>");
     EXPECT_EQ(refusal("<vlist><true/></vlist>"), "line 1: <vlist> has no version");
     EXPECT_EQ(refusal("<vlist version=\"2\"><true/></vlist>"), "line 1: unsupported vlist version \"2\"");
     EXPECT_EQ(refusal(document("<dict>\n  <key>a</key><true/>\n</array>\n")).substr(0, 8), "line 5: ");
