@@ -406,7 +406,8 @@ bool Value::operator==(const Value& other) const
     case Type::Data:
         return *asData() == *other.asData();
     case Type::Date:
-        return m_scalar.r == other.m_scalar.r;
+        // As for reals: a NaN date (the wire allows one) equals itself, so round trips compare.
+        return m_scalar.r == other.m_scalar.r || (std::isnan(m_scalar.r) && std::isnan(other.m_scalar.r));
     case Type::Uuid:
         return m_uuid == other.m_uuid;
     case Type::Array: {

@@ -41,6 +41,9 @@ TEST(Value, NanEqualsItselfSoRoundTripsCompare)
 {
     EXPECT_EQ(Value(std::nan("")), Value(std::nan("")));
     EXPECT_NE(Value(std::nan("")), Value(0.0));
+    EXPECT_EQ(Value::date(std::nan("")), Value::date(std::nan("")));
+    EXPECT_NE(Value::date(std::nan("")), Value::date(0));
+    EXPECT_NE(Value::date(0), Value(0.0));
 }
 
 TEST(Value, IntegerReadsRespectRange)
