@@ -68,9 +68,20 @@ void OMDConduitClient::submitRequest(const ConduitEvent& event)
         OM_PROBE2(request__input, pid, text.c_str());
     }
 
+    if (m_waitingRequests.fetch_add(1, std::memory_order_relaxed) >= kMaxWaitingRequests) {
+        // A client this far ahead of its replies is misbehaving: it loses its own connection,
+        // and the requests it already queued are dropped at dispatch like any dead client's.
+        m_waitingRequests.fetch_sub(1, std::memory_order_relaxed);
+        OMLog::ops().error("client %d has %u requests waiting; closing its connection", pid,
+            static_cast<uint32_t>(kMaxWaitingRequests));
+        if (auto connection = m_connection.lock())
+            connection->cancel();
+        return;
+    }
     auto transaction = std::make_shared<Transaction>(event, shared_from_this());
     m_server->submitWork([transaction] {
         auto& client = *transaction->client();
+        client.m_waitingRequests.fetch_sub(1, std::memory_order_relaxed);
         uint32_t count = ++client.m_requestCount;
         if (count % 1000 == 0)
             OMLog::ops().debug("client %d used %u requests so far", client.pid(), count);

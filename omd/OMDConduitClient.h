@@ -53,6 +53,10 @@ public:
 
     // The executable path is read into a buffer of this size; a longer path counts as unreadable.
     static constexpr size_t kExecutablePathBufferSize = 2048;
+    // Requests of one client that may wait for the service queue at once. Every reply is bounded
+    // by the transport; this bounds what a client that sends without reading replies can make the
+    // daemon hold. Far above what any well-behaved client pipelines.
+    static constexpr uint32_t kMaxWaitingRequests = 4096;
 
 private:
     OMDConduitClient(const std::shared_ptr<ConduitConnection>& connection, std::shared_ptr<OMDServer> server);
@@ -66,6 +70,7 @@ private:
     // Written on the connection's delivery thread (dead), read on "service" (dispatch). A request
     // racing with dead is either answered or dropped; both are fine.
     std::atomic<bool> m_acceptWork { true };
+    std::atomic<uint32_t> m_waitingRequests { 0 }; // submitted, not yet dispatched
     // Null when no signing identity could be made: every entitlement then counts as absent.
     std::shared_ptr<CodeSigningTask> _task;
     // Touched only on "service"; wraps at 2^32.

@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <filesystem>
 
+#include "omd/OMDConduitClient.h"
 #include "platform/Format.h"
 #include "tests/support/DaemonProcess.h"
 
@@ -257,6 +258,37 @@ TEST_F(DaemonEnvelope, QueuedRequestsOfADeadClientAreDropped)
     ASSERT_TRUE(reply);
     ASSERT_TRUE(m_daemon->waitForMessage(ours("client %d requested %s", "from-live-client")));
     EXPECT_EQ(requestsLogged("from-dead-client"), 0u);
+    EXPECT_TRUE(m_daemon->running());
+}
+
+TEST_F(DaemonEnvelope, ClientFarAheadOfItsRepliesLosesOnlyItsConnection)
+{
+    auto witness = connect();
+    ASSERT_TRUE(witness);
+    ASSERT_TRUE(witness->call(daemonRequest("warm-up")));
+
+    auto frozen = m_daemon->freezeThread("service");
+    if (!frozen)
+        GTEST_SKIP() << "cannot stop a thread of the daemon (no ptrace permission)";
+    auto flooding = connect();
+    ASSERT_TRUE(flooding);
+    // With the service queue stopped, exactly the bound waits; one more closes the connection.
+    for (uint32_t i = 0; i <= OMDConduitClient::kMaxWaitingRequests; ++i)
+        flooding->send(daemonRequest("flood"));
+    EXPECT_TRUE(flooding->raw().waitForClose());
+    ASSERT_TRUE(m_daemon->waitForMessage(ours("client %d has 4096 requests waiting; closing its connection")));
+    ASSERT_TRUE(m_daemon->waitForMessage(ours("client %d is dead")));
+    // As for any dead client: a connection accepted after that line proves acceptWork is off.
+    size_t before = clientsMade(m_daemon->lines());
+    auto late = connect();
+    ASSERT_TRUE(late);
+    ASSERT_TRUE(m_daemon->waitForLines([&](const auto& lines) { return clientsMade(lines) > before; }));
+    frozen.reset();
+
+    auto reply = witness->call(daemonRequest("after-flood"));
+    ASSERT_TRUE(reply);
+    EXPECT_EQ(text(*reply), "unrecognized request");
+    EXPECT_EQ(requestsLogged("flood"), 0u);
     EXPECT_TRUE(m_daemon->running());
 }
 
