@@ -45,6 +45,17 @@ protected:
             [](const DaemonLogLine& line) { return line.message.starts_with(ours("new client %d ")); }));
     }
 
+    // The record stops accepting work just after its "is dead" line, on the transport's one
+    // thread; a connection that thread accepts afterwards proves that it has done so.
+    bool waitUntilOurDeadClientStopsAcceptingWork()
+    {
+        if (!m_daemon->waitForMessage(ours("client %d is dead")))
+            return false;
+        size_t before = clientsMade(m_daemon->lines());
+        auto late = connect();
+        return late && m_daemon->waitForLines([&](const auto& lines) { return clientsMade(lines) > before; });
+    }
+
     std::unique_ptr<DaemonProcess> m_daemon;
 };
 
@@ -245,13 +256,7 @@ TEST_F(DaemonEnvelope, QueuedRequestsOfADeadClientAreDropped)
         // A bad version is answered even for a dead client; that answer then has nowhere to go.
         dying->send(daemonRequest("bad-version", 1));
     }
-    ASSERT_TRUE(m_daemon->waitForMessage(ours("client %d is dead")));
-    // The record stops accepting work just after that line, on the transport's one thread; a
-    // connection that thread accepts afterwards proves that it has done so.
-    size_t before = clientsMade(m_daemon->lines());
-    auto late = connect();
-    ASSERT_TRUE(late);
-    ASSERT_TRUE(m_daemon->waitForLines([&](const auto& lines) { return clientsMade(lines) > before; }));
+    ASSERT_TRUE(waitUntilOurDeadClientStopsAcceptingWork());
     frozen.reset();
 
     auto reply = witness->call(daemonRequest("from-live-client"));
@@ -277,12 +282,7 @@ TEST_F(DaemonEnvelope, ClientFarAheadOfItsRepliesLosesOnlyItsConnection)
         flooding->send(daemonRequest("flood"));
     EXPECT_TRUE(flooding->raw().waitForClose());
     ASSERT_TRUE(m_daemon->waitForMessage(ours("client %d has 4096 requests waiting; closing its connection")));
-    ASSERT_TRUE(m_daemon->waitForMessage(ours("client %d is dead")));
-    // As for any dead client: a connection accepted after that line proves acceptWork is off.
-    size_t before = clientsMade(m_daemon->lines());
-    auto late = connect();
-    ASSERT_TRUE(late);
-    ASSERT_TRUE(m_daemon->waitForLines([&](const auto& lines) { return clientsMade(lines) > before; }));
+    ASSERT_TRUE(waitUntilOurDeadClientStopsAcceptingWork());
     frozen.reset();
 
     auto reply = witness->call(daemonRequest("after-flood"));
