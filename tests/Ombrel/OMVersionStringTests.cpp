@@ -102,3 +102,28 @@ TEST(CompareVersionString, SortsConsistently)
         ASSERT_EQ(shuffled, ordered);
     }
 }
+
+// Indexes look texts up by their equivalence key instead of comparing: every pair over a small
+// alphabet (digits, zeros, letters, dots) must agree with the comparison both ways.
+TEST(CompareVersionString, EquivalenceKeyAgreesWithTheComparison)
+{
+    const std::string alphabet = "001a.9";
+    std::vector<std::string> texts = { "" };
+    for (size_t length = 1; length <= 4; ++length) {
+        const size_t before = texts.size();
+        for (size_t i = 0; i < before; ++i) {
+            if (texts[i].size() + 1 != length)
+                continue;
+            for (char c : alphabet)
+                texts.push_back(texts[i] + c);
+        }
+    }
+    for (const auto& a : texts) {
+        for (const auto& b : texts) {
+            const bool equivalent = compareVersionString(a, b) == 0;
+            ASSERT_EQ(om::VersionString::equivalenceKey(a) == om::VersionString::equivalenceKey(b), equivalent)
+                << '"' << a << "\" vs \"" << b << '"';
+        }
+    }
+    EXPECT_EQ(om::VersionString::equivalenceKey("com.a007.x00"), "com.a7.x0");
+}

@@ -1,4 +1,4 @@
-#include "Ombrel/OMVersionString.h"
+#include "platform/VersionString.h"
 
 namespace om {
 
@@ -27,7 +27,7 @@ int sign(int value)
 
 } // namespace
 
-int compareVersionString(std::string_view a, std::string_view b)
+int VersionString::compare(std::string_view a, std::string_view b)
 {
     size_t i = 0;
     size_t j = 0;
@@ -54,6 +54,25 @@ int compareVersionString(std::string_view a, std::string_view b)
     if (j < b.size())
         return -1;
     return 0;
+}
+
+std::string VersionString::equivalenceKey(std::string_view text)
+{
+    std::string key;
+    key.reserve(text.size());
+    size_t index = 0;
+    while (index < text.size()) {
+        if (!isDigit(text[index])) {
+            key.push_back(text[index++]);
+            continue;
+        }
+        std::string_view number = takeNumber(text, index);
+        if (number.empty())
+            key.push_back('0');
+        else
+            key.append(number);
+    }
+    return key;
 }
 
 } // namespace om
