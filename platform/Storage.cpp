@@ -1,0 +1,145 @@
+#include "platform/Storage.h"
+
+#include <fcntl.h>
+#include <pwd.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <vector>
+
+#include "platform/UniqueFd.h"
+#include "platform/Uuid.h"
+
+namespace om {
+
+namespace {
+
+Result<void> writeAll(int fd, std::span<const uint8_t> bytes, const std::string& path)
+{
+    size_t done = 0;
+    while (done < bytes.size()) {
+        const ssize_t written = ::write(fd, bytes.data() + done, bytes.size() - done);
+        if (written < 0 && errno == EINTR)
+            continue;
+        if (written < 0)
+            return OMError::fromErrno("write " + path, errno);
+        done += size_t(written);
+    }
+    return {};
+}
+
+std::string directoryOf(const std::string& path)
+{
+    const size_t slash = path.rfind('/');
+    if (slash == std::string::npos)
+        return ".";
+    return slash == 0 ? "/" : path.substr(0, slash);
+}
+
+} // namespace
+
+bool Storage::isMultiUser()
+{
+    return ::geteuid() != 0;
+}
+
+std::optional<std::string> Storage::environment(const char* name)
+{
+    const char* value = std::getenv(name); // NOLINT(concurrency-mt-unsafe): nothing here sets the environment
+    if (!value || !*value)
+        return std::nullopt;
+    return std::string(value);
+}
+
+std::string Storage::homeDirectory()
+{
+    if (auto home = environment("HOME"))
+        return *home;
+    std::vector<char> buffer(4096);
+    passwd entry {};
+    passwd* found = nullptr;
+    if (::getpwuid_r(::geteuid(), &entry, buffer.data(), buffer.size(), &found) == 0 && found && found->pw_dir)
+        return found->pw_dir;
+    return "/";
+}
+
+std::string Storage::dataHome()
+{
+    if (auto data = environment("XDG_DATA_HOME"))
+        return *data;
+    return homeDirectory() + "/.local/share";
+}
+
+std::string Storage::configHome()
+{
+    if (auto config = environment("XDG_CONFIG_HOME"))
+        return *config;
+    return homeDirectory() + "/.config";
+}
+
+std::string Storage::location(const char* name, std::string_view systemDefault, const std::string& userDefault)
+{
+    if (auto set = environment(name))
+        return *set;
+    return isMultiUser() ? userDefault : std::string(systemDefault);
+}
+
+std::string Storage::userDataContainer(std::string_view identifier)
+{
+    return dataHome() + "/omd/containers/" + std::string(identifier);
+}
+
+bool Storage::isSafeComponent(std::string_view text)
+{
+    return !text.empty() && text.size() <= 255 && text != "." && text != ".."
+        && text.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
+}
+
+Result<void> Storage::makeDirectories(const std::string& path, unsigned mode)
+{
+    if (path.empty())
+        return OMError::platform(kPlatformErrorUnsupported, "empty directory path");
+    for (size_t slash = path.find('/', 1);; slash = path.find('/', slash + 1)) {
+        const std::string prefix = path.substr(0, slash);
+        if (!prefix.empty() && ::mkdir(prefix.c_str(), mode) < 0 && errno != EEXIST)
+            return OMError::fromErrno("mkdir " + prefix, errno);
+        if (slash == std::string::npos)
+            break;
+    }
+    struct stat info;
+    if (::stat(path.c_str(), &info) < 0)
+        return OMError::fromErrno("stat " + path, errno);
+    if (!S_ISDIR(info.st_mode))
+        return OMError::platform(kPlatformErrorUnsupported, path + " is not a directory");
+    return {};
+}
+
+Result<void> Storage::writeFileAtomically(const std::string& path, std::span<const uint8_t> bytes, unsigned mode)
+{
+    const std::string directory = directoryOf(path);
+    const std::string temporary = path + ".tmp-" + Uuid::random().string();
+    UniqueFd file(::open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, mode));
+    if (!file.valid())
+        return OMError::fromErrno("open " + temporary, errno);
+    auto fail = [&](const OMError& error) -> Result<void> {
+        (void)::unlink(temporary.c_str()); // the old file is untouched; the partial copy goes
+        return error;
+    };
+    if (auto written = writeAll(file.get(), bytes, temporary); !written.ok())
+        return fail(written.error());
+    if (::fsync(file.get()) < 0)
+        return fail(OMError::fromErrno("fsync " + temporary, errno));
+    file.reset();
+    if (::rename(temporary.c_str(), path.c_str()) < 0)
+        return fail(OMError::fromErrno("rename " + temporary, errno));
+    UniqueFd parent(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!parent.valid())
+        return OMError::fromErrno("open " + directory, errno);
+    if (::fsync(parent.get()) < 0)
+        return OMError::fromErrno("fsync " + directory, errno);
+    return {};
+}
+
+} // namespace om

@@ -1,0 +1,48 @@
+// Where the platform keeps state, and how files are replaced safely.
+//
+// A system instance runs as root and keeps its state under /var/lib/omd and /etc/omd; any other
+// user is a per-user instance ("multi-user mode") whose state lives in its XDG directories.
+// Every location can be overridden from the environment, so that tests stay inside their own
+// temporary directory.
+#pragma once
+
+#include <optional>
+#include <span>
+#include <string>
+#include <string_view>
+
+#include "platform/Result.h"
+
+namespace om {
+
+class Storage {
+public:
+    // True when this process runs as a user other than root.
+    static bool isMultiUser();
+    // $HOME, else the password database's home directory, else "/".
+    static std::string homeDirectory();
+    // ${XDG_DATA_HOME:-~/.local/share}
+    static std::string dataHome();
+    // ${XDG_CONFIG_HOME:-~/.config}
+    static std::string configHome();
+    // The value of an environment variable when set and not empty.
+    static std::optional<std::string> environment(const char* name);
+    // The environment's setting of name, else systemDefault for root, else userDefault.
+    static std::string location(const char* name, std::string_view systemDefault, const std::string& userDefault);
+
+    // The per-user data container of identifier: <dataHome>/omd/containers/<identifier>.
+    static std::string userDataContainer(std::string_view identifier);
+    // Whether text can name one directory entry: not empty, not "." or "..", no '/' or NUL, and
+    // at most 255 bytes.
+    static bool isSafeComponent(std::string_view text);
+
+    // mkdir -p, with mode for the directories it makes.
+    static Result<void> makeDirectories(const std::string& path, unsigned mode = 0755);
+    // Replaces the file at path with bytes so that a crash at any moment leaves either the old or
+    // the new contents: a temporary file in the same directory, fsync, rename, fsync of the
+    // directory. The file gets mode (before umask) when it is made.
+    static Result<void> writeFileAtomically(
+        const std::string& path, std::span<const uint8_t> bytes, unsigned mode = 0644);
+};
+
+} // namespace om

@@ -1,0 +1,88 @@
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include "platform/Storage.h"
+#include "tests/support/BundleFixture.h"
+
+using om::Storage;
+
+namespace {
+
+std::string contentsOf(const std::string& path)
+{
+    std::ifstream file(path);
+    std::stringstream text;
+    text << file.rdbuf();
+    return text.str();
+}
+
+std::span<const uint8_t> bytesOf(std::string_view text)
+{
+    return { reinterpret_cast<const uint8_t*>(text.data()), text.size() };
+}
+
+} // namespace
+
+TEST(Storage, SafeComponentsNameExactlyOneEntry)
+{
+    const struct {
+        std::string text;
+        bool safe;
+    } cases[] = {
+        { "com.orvex.notes", true },
+        { "..hidden", true },
+        { std::string(255, 'a'), true },
+        { std::string(256, 'a'), false },
+        { "", false },
+        { ".", false },
+        { "..", false },
+        { "a/b", false },
+        { "../../etc", false },
+        { std::string("a\0b", 3), false },
+    };
+    for (const auto& test : cases)
+        EXPECT_EQ(Storage::isSafeComponent(test.text), test.safe) << test.text;
+}
+
+TEST(Storage, AtomicWriteReplacesWholeAndLeavesNothingBehind)
+{
+    om::test::BundleFixture fixture;
+    const std::string path = fixture.root() + "/state/db.vlist";
+    ASSERT_TRUE(Storage::makeDirectories(fixture.root() + "/state").ok());
+
+    ASSERT_TRUE(Storage::writeFileAtomically(path, bytesOf("first"), 0600).ok());
+    ASSERT_TRUE(Storage::writeFileAtomically(path, bytesOf("second, longer"), 0600).ok());
+
+    EXPECT_EQ(contentsOf(path), "second, longer");
+    struct stat info;
+    ASSERT_EQ(::stat(path.c_str(), &info), 0);
+    EXPECT_EQ(info.st_mode & 0077, 0u);
+    size_t entries = 0;
+    for ([[maybe_unused]] const auto& entry : std::filesystem::directory_iterator(fixture.root() + "/state"))
+        ++entries;
+    EXPECT_EQ(entries, 1u);
+}
+
+// A rename that fails (here: onto a directory that is not empty, which root cannot do either)
+// must leave what was there and take its temporary file away.
+TEST(Storage, AFailedWriteKeepsWhatWasThereAndCleansUp)
+{
+    om::test::BundleFixture fixture;
+    const std::string path = fixture.makeDirectory("state/db.vlist");
+    fixture.writeFile("state/db.vlist/keep", "old");
+
+    auto written = Storage::writeFileAtomically(path, bytesOf("new"));
+
+    ASSERT_FALSE(written.ok());
+    EXPECT_NE(written.error().localizedDescription().find("rename"), std::string::npos);
+    EXPECT_EQ(contentsOf(path + "/keep"), "old");
+    size_t entries = 0;
+    for ([[maybe_unused]] const auto& entry : std::filesystem::directory_iterator(fixture.root() + "/state"))
+        ++entries;
+    EXPECT_EQ(entries, 1u);
+}
