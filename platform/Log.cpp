@@ -42,6 +42,8 @@ LogLevel parseLevel(const char* text)
         return LogLevel::Info;
     if (strcasecmp(text, "error") == 0)
         return LogLevel::Error;
+    if (strcasecmp(text, "off") == 0)
+        return LogLevel::Off;
     return LogLevel::Default;
 }
 
@@ -83,6 +85,7 @@ int syslogPriority(LogLevel level)
     case LogLevel::Default:
         return 5;
     case LogLevel::Error:
+    case LogLevel::Off:
         return 3;
     }
     return 5;
@@ -98,6 +101,7 @@ const char* levelName(LogLevel level)
     case LogLevel::Default:
         return "notice";
     case LogLevel::Error:
+    case LogLevel::Off:
         return "error";
     }
     return "notice";

@@ -1,7 +1,7 @@
 // Structured log ("evlog"). Each handle is a (subsystem, category) pair. Records go to the systemd
 // journal when its socket exists (fields SYSLOG_IDENTIFIER, OM_SUBSYSTEM, OM_CATEGORY, PRIORITY),
 // otherwise one line per record on stderr. The threshold comes from EVLOG_LEVEL (debug, info,
-// default, error; default "default") and is read once. Tests install a Log::Capture, which sees
+// default, error, off; default "default") and is read once. Tests install a Log::Capture, which sees
 // every record, whatever the threshold, while it lives.
 #pragma once
 
@@ -19,7 +19,8 @@
 
 namespace om {
 
-enum class LogLevel : uint8_t { Debug, Info, Default, Error };
+// Off is only a threshold (EVLOG_LEVEL=off): no record is written anywhere but to captures.
+enum class LogLevel : uint8_t { Debug, Info, Default, Error, Off };
 
 class Log {
 public:

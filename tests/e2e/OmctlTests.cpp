@@ -308,6 +308,8 @@ TEST_F(OmctlTest, UnreachableServiceExitsThree)
     EXPECT_EQ(result.status, 3);
     EXPECT_NE(result.err.find("omctl: cannot reach omd at " + m_directory + "/nobody: "), std::string::npos)
         << result.err;
+    // Said once: the client library's own log line about the broken connection stays off.
+    EXPECT_EQ(std::count(result.err.begin(), result.err.end(), '\n'), 1) << result.err;
     EXPECT_TRUE(result.out.empty());
 }
 

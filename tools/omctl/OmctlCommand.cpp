@@ -41,7 +41,9 @@ void OmctlCommand::printHelp(std::ostream& out)
            "  --json          print results as JSON\n"
            "  -h, --help      show this help; 'omctl <command> --help' shows a command's\n\n"
            "Exit status: 0 success, 1 omd answered with an error, 2 usage error,\n"
-           "3 omd could not be reached.\n";
+           "3 omd could not be reached.\n\n"
+           "omctl reports failures itself; EVLOG_LEVEL=debug (or info, default, error)\n"
+           "also shows the client library's log.\n";
 }
 
 int OmctlCommand::run(const std::vector<std::string>& arguments, std::istream& in, std::ostream& out, std::ostream& err)
