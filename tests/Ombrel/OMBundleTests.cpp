@@ -234,7 +234,7 @@ TEST(OMBundle, NullHandleAnswersNothing)
 
 TEST(OMBundle, SampleAppsAndTheirPlugInsRead)
 {
-    const std::string samples = std::filesystem::canonical(std::string(OM_SOURCE_DIR) + "/samples").string();
+    const std::string samples = std::filesystem::canonical(std::string(OM_BINARY_DIR) + "/samples").string();
     struct Sample {
         std::string app, appIdentifier, plugIn, plugInIdentifier, extensionPoint;
     };
