@@ -3,7 +3,8 @@
 // programs, which rebuild it from its wire form.
 //
 // The record's source is split by concern: OMPlugInCore.cpp (fields, setup, derived properties,
-// kinds, the configuration check) and OMPlugInCoreSDK.cpp (merging the extension point's SDK entry).
+// kinds, the configuration check), OMPlugInCoreSDK.cpp (merging the extension point's SDK entry)
+// and OMPlugInCoreForm.cpp (the wire form).
 //
 // Every stored field is read and written whole under the record's own lock, so a reader on another
 // queue sees either the old or the new value. Compound updates (setDictionaries, canonicalize,
@@ -152,6 +153,15 @@ public:
     // True for the keys whose SDK value replaces the plug-in's.
     virtual bool sdkOverridesKey(std::string_view key) const;
     static Value mergeSharedResources(const Value& sdk, const Value& into);
+
+    // Wire form. "export" is a C++ keyword, hence exportForm. The form, or none when a base value
+    // is absent; error is never filled (a caller that reports filled errors keeps one path).
+    Value exportForm(std::optional<OMError>* error = nullptr) const;
+    static std::shared_ptr<OMPlugInCore> initWithForm(const Value& form);
+    bool setupWithForm(const Value& form);
+    void updateFromForm(const Value& form);
+    // A none value removes the key. A record without annotations starts an empty dictionary.
+    void setAnnotation(std::string_view key, const Value& value);
 
 protected:
     // The bare record: every field absent, onSystemVolume false, numbers 0.

@@ -1,7 +1,10 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
+#include <functional>
+#include <latch>
 #include <map>
+#include <thread>
 #include <unordered_set>
 
 #include "Ombrel/OMBundle.h"
@@ -435,4 +438,219 @@ TEST_F(OMPlugInCoreSDK, SubclassSuppliesEntriesAndWidensOverrides)
     EXPECT_EQ(derived.pluginKey("Shared"), Value::array({ "solo", "duo" }));
     EXPECT_EQ(
         OMPlugInCore::mergeSharedResources(Value::array({ "x", "x" }), Value::array({ "x" })), Value::array({ "x" }));
+}
+
+class OMPlugInCoreForm : public ::testing::Test {
+protected:
+    // A record every base value of which is present, its uuid read from lower-case text.
+    std::shared_ptr<OMPlugInCore> exportable()
+    {
+        auto plugIn = record(kAppex, info(complete(), { { "VBBundleInfoVlistURL", "file:///x/Info.vlist" } }), Value(),
+            Uuid::parse("0f3e9a4c-2b1d-4c5e-8f70-aabbccddeeff"));
+        plugIn->setOriginalIdentifier("com.example.original");
+        plugIn->setHubProtocolVersion(2);
+        plugIn->setLastModified(1700000000);
+        plugIn->setOnSystemVolume(true);
+        return plugIn;
+    }
+
+    static std::vector<std::string> keysOf(const Value& form)
+    {
+        std::vector<std::string> keys;
+        for (const auto& [key, value] : form.entries())
+            keys.push_back(key);
+        return keys;
+    }
+};
+
+TEST_F(OMPlugInCoreForm, ExportWritesTheBaseKeysInOrder)
+{
+    auto plugIn = exportable();
+    std::optional<om::OMError> error;
+
+    const Value form = plugIn->exportForm(&error);
+
+    EXPECT_FALSE(error);
+    EXPECT_EQ(keysOf(form),
+        (std::vector<std::string> { "hubProtocolVersion", "path", "systemResident", "identifier", "original-identifier",
+            "version", "bundleInfo", "info", "uuid", "lastmodified", "annotations" }));
+    EXPECT_EQ(form["hubProtocolVersion"], Value(2u));
+    EXPECT_EQ(form["path"], Value(kAppex));
+    EXPECT_EQ(form["systemResident"], Value(true));
+    EXPECT_EQ(form["original-identifier"], Value("com.example.original"));
+    EXPECT_EQ(form["version"], Value("2.1"));
+    EXPECT_FALSE(form["bundleInfo"].contains("VBBundleInfoVlistURL"));
+    EXPECT_TRUE(plugIn->bundleInfoDictionary().contains("VBBundleInfoVlistURL"));
+    EXPECT_EQ(form["info"], plugIn->plugInDictionary());
+    EXPECT_EQ(form["uuid"], Value("0F3E9A4C-2B1D-4C5E-8F70-AABBCCDDEEFF"));
+    EXPECT_EQ(form["lastmodified"], Value(1700000000));
+    EXPECT_EQ(form["annotations"], Value::dictionary({}));
+}
+
+TEST_F(OMPlugInCoreForm, OptionalKeysFollowInTheirOrder)
+{
+    auto plugIn = exportable();
+    plugIn->setLocalizedShortName("Share");
+    plugIn->setLocalizedName("Share It");
+    plugIn->setLocalizedContainingName("Notes");
+    plugIn->setContainingUrl(OMBundle::fileURL("/Apps/Notes.app"));
+    plugIn->setEntitlements(Value::dictionary({ { "com.orvex.x", true } }));
+
+    const Value form = plugIn->exportForm();
+
+    const auto keys = keysOf(form);
+    ASSERT_EQ(keys.size(), 16u);
+    EXPECT_EQ(std::vector<std::string>(keys.begin() + 11, keys.end()),
+        (std::vector<std::string> { "entitlements", "containingPath", "localizedContainingDisplayName",
+            "localizedDisplayName", "localizedShortName" }));
+    EXPECT_EQ(form["containingPath"], Value("/Apps/Notes.app"));
+}
+
+TEST_F(OMPlugInCoreForm, RecordMissingABaseValueIsNotExported)
+{
+    const struct {
+        const char* name;
+        std::function<void(OMPlugInCore&)> change;
+    } cases[] = {
+        { "original identifier", [](OMPlugInCore& r) { r.setOriginalIdentifier(std::nullopt); } },
+        { "version", [](OMPlugInCore& r) { r.setPlugInDictionary(Value::dictionary({})); } },
+        { "plug-in dictionary", [](OMPlugInCore& r) { r.setPlugInDictionary(Value()); } },
+        { "info dictionary", [](OMPlugInCore& r) { r.setBundleInfoDictionary(Value()); } },
+        { "url", [](OMPlugInCore& r) { r.setUrl("http://example.com/Share.appex"); } },
+        { "uuid", [](OMPlugInCore& r) { r.setUuid(std::nullopt); } },
+    };
+    for (const auto& test : cases) {
+        auto plugIn = exportable();
+        test.change(*plugIn);
+        std::optional<om::OMError> error;
+        EXPECT_TRUE(plugIn->exportForm(&error).isNone()) << test.name;
+        EXPECT_FALSE(error) << test.name;
+    }
+}
+
+TEST_F(OMPlugInCoreForm, ReadingBackGivesTheSameRecord)
+{
+    auto plugIn = exportable();
+    plugIn->setLocalizedName("Share It");
+    plugIn->setLocalizedShortName("Share");
+    plugIn->setLocalizedContainingName("Notes");
+    plugIn->setContainingUrl(OMBundle::fileURL("/Apps/Notes.app"));
+    plugIn->setAnnotation("election", 1);
+    // What travels under "info" is not what the reader takes.
+    plugIn->setPlugInDictionary(complete({ { "OnlyInInfo", true } }));
+    DictionaryBuilder form(plugIn->exportForm());
+    form.set("hash", Value::data(std::vector<uint8_t>(20, 7)));
+    form.set("requirement", "anything");
+
+    auto read = OMPlugInCore::initWithForm(form.build());
+
+    ASSERT_TRUE(read);
+    EXPECT_TRUE(*read == *plugIn);
+    EXPECT_EQ(read->identifier(), plugIn->identifier());
+    EXPECT_EQ(read->path(), plugIn->path());
+    EXPECT_EQ(read->version(), plugIn->version());
+    EXPECT_EQ(read->originalIdentifier(), plugIn->originalIdentifier());
+    EXPECT_EQ(read->hubProtocolVersion(), 2u);
+    EXPECT_EQ(read->lastModified(), 1700000000);
+    EXPECT_TRUE(read->onSystemVolume());
+    EXPECT_EQ(read->localizedName(), "Share It");
+    EXPECT_EQ(read->localizedShortName(), "Share");
+    EXPECT_EQ(read->localizedContainingName(), "Notes");
+    EXPECT_EQ(read->containingUrl(), plugIn->containingUrl());
+    EXPECT_EQ(read->annotations(), Value::dictionary({ { "election", 1 } }));
+    EXPECT_EQ(read->plugInDictionary(), complete());
+    EXPECT_EQ(read->cdhash(), std::vector<uint8_t>(20, 7));
+    EXPECT_EQ(read->requirement(), "anything");
+}
+
+TEST_F(OMPlugInCoreForm, ReaderDefaultsAndUuids)
+{
+    const Value minimal = Value::dictionary({ { "path", kAppex }, { "identifier", "com.example.share" } });
+    auto read = OMPlugInCore::initWithForm(minimal);
+    ASSERT_TRUE(read);
+    EXPECT_EQ(read->hubProtocolVersion(), 1u);
+    EXPECT_EQ(read->lastModified(), 0);
+    EXPECT_FALSE(read->onSystemVolume() || read->localizedName() || read->containingUrl());
+    EXPECT_TRUE(read->bundleInfoDictionary().isNone() && read->plugInDictionary().isNone());
+    EXPECT_TRUE(read->annotations().isNone());
+
+    auto exporter = exportable();
+    const Value form = exporter->exportForm();
+    for (const Value& uuid : { Value("not a uuid"), Value(7), Value() }) {
+        DictionaryBuilder changed(form);
+        changed.set("uuid", uuid);
+        auto other = OMPlugInCore::initWithForm(changed.build());
+        ASSERT_TRUE(other && other->uuid()) << uuid.description();
+        EXPECT_FALSE(*other == *exporter) << uuid.description();
+    }
+    DictionaryBuilder native(form);
+    native.set("uuid", Value::uuid(*exporter->uuid()));
+    EXPECT_TRUE(*OMPlugInCore::initWithForm(native.build()) == *exporter);
+}
+
+TEST_F(OMPlugInCoreForm, FormsThatNameNoPlugInAreRefused)
+{
+    const Value form = exportable()->exportForm();
+    const struct {
+        const char* name;
+        const char* key;
+        Value value;
+        std::string message;
+    } cases[] = {
+        { "no path", "path", Value(), "" },
+        { "path not a string", "path", 7, "" },
+        { "no identifier", "identifier", Value(), "missing identifier in plug-in at " + kAppex },
+        { "bundleInfo an array", "bundleInfo", Value::array({}),
+            "malformed plug-in dictionary in plug-in com.example.share at file://" + kAppex + ": ()" },
+    };
+    for (const auto& test : cases) {
+        DictionaryBuilder changed(form);
+        changed.set(test.key, test.value);
+        Log::Capture capture;
+        EXPECT_FALSE(OMPlugInCore::initWithForm(changed.build())) << test.name;
+        if (test.message.empty())
+            EXPECT_TRUE(capture.records().empty()) << test.name;
+        else
+            EXPECT_EQ(capture.count(test.message), 1u) << test.name;
+    }
+}
+
+TEST_F(OMPlugInCoreForm, AnnotationsAreReplacedWhole)
+{
+    auto plugIn = exportable();
+    plugIn->setAnnotation("gone", "x");
+    plugIn->setAnnotation("election", 1);
+    const Value held = plugIn->annotations();
+
+    plugIn->setAnnotation("gone", Value());
+    plugIn->setAnnotation("election", 2);
+
+    EXPECT_EQ(plugIn->annotations(), Value::dictionary({ { "election", 2 } }));
+    EXPECT_EQ(held, Value::dictionary({ { "gone", "x" }, { "election", 1 } }));
+    plugIn->updateFromForm(Value::dictionary({ { "annotations", Value::dictionary({ { "other", true } }) } }));
+    EXPECT_EQ(plugIn->annotations(), Value::dictionary({ { "other", true } }));
+    plugIn->updateFromForm(Value::dictionary({}));
+    EXPECT_TRUE(plugIn->annotations().isNone());
+    EXPECT_EQ(plugIn->identifier(), "com.example.share");
+    plugIn->setAnnotation("absent", Value());
+    EXPECT_EQ(plugIn->annotations(), Value::dictionary({}));
+}
+
+TEST_F(OMPlugInCoreForm, ConcurrentAnnotationChangesAreNotLost)
+{
+    auto plugIn = exportable();
+    constexpr int kThreads = 4;
+    constexpr int kEach = 200;
+    std::latch start(kThreads);
+    std::vector<std::thread> threads;
+    for (int t = 0; t < kThreads; ++t) {
+        threads.emplace_back([&, t] {
+            start.arrive_and_wait();
+            for (int i = 0; i < kEach; ++i)
+                plugIn->setAnnotation(std::to_string(t) + "." + std::to_string(i), i);
+        });
+    }
+    for (auto& thread : threads)
+        thread.join();
+    EXPECT_EQ(plugIn->annotations().count(), size_t(kThreads * kEach));
 }
