@@ -12,12 +12,12 @@
 #include <climits>
 #include <cstdlib>
 #include <ctime>
+#include <filesystem>
 #include <optional>
 
 #include "platform/Digest.h"
 #include "platform/Storage.h"
 #include "platform/UniqueFd.h"
-#include "platform/Uuid.h"
 
 namespace om {
 
@@ -39,14 +39,6 @@ std::span<const uint8_t> bytesOf(std::string_view text)
     return { reinterpret_cast<const uint8_t*>(text.data()), text.size() };
 }
 
-std::string directoryOf(const std::string& path)
-{
-    const size_t slash = path.rfind('/');
-    if (slash == std::string::npos)
-        return ".";
-    return slash == 0 ? "/" : path.substr(0, slash);
-}
-
 Result<void> fillRandom(std::span<uint8_t> bytes)
 {
     size_t filled = 0;
@@ -61,46 +53,15 @@ Result<void> fillRandom(std::span<uint8_t> bytes)
     return {};
 }
 
-Result<void> writeAll(int fd, std::span<const uint8_t> bytes, const std::string& path)
-{
-    size_t done = 0;
-    while (done < bytes.size()) {
-        const ssize_t written = ::write(fd, bytes.data() + done, bytes.size() - done);
-        if (written < 0 && errno == EINTR)
-            continue;
-        if (written < 0)
-            return OMError::fromErrno("write " + path, errno);
-        done += size_t(written);
-    }
-    return {};
-}
-
-// The key appears whole or not at all: it is written and synced under a name of its own, then
-// linked into place, which fails with EEXIST when another process made the key first. A reader can
-// therefore never see a key file that is still being written.
+// Racing first users each write a key of their own; exactly one lands, and the others use it.
 Result<void> makeKey(const std::string& path)
 {
-    const std::string directory = directoryOf(path);
-    OM_TRY(Storage::makeDirectories(directory));
-    const std::string temporary = path + "." + Uuid::random().string() + ".tmp";
-    UniqueFd file(::open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_NOFOLLOW | O_CLOEXEC, 0600));
-    if (!file.valid())
-        return OMError::fromErrno("open " + temporary, errno);
+    OM_TRY(Storage::makeDirectories(std::filesystem::path(path).parent_path()));
     Key key {};
-    auto made = [&]() -> Result<void> {
-        OM_TRY(fillRandom(key));
-        OM_TRY(writeAll(file.get(), key, temporary));
-        if (::fsync(file.get()) < 0)
-            return OMError::fromErrno("fsync " + temporary, errno);
-        if (::link(temporary.c_str(), path.c_str()) < 0 && errno != EEXIST)
-            return OMError::fromErrno("link " + path, errno);
-        return {};
-    }();
-    (void)::unlink(temporary.c_str()); // the key, if made, lives on under its own name
-    OM_TRY(std::move(made));
-    UniqueFd parent(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-    if (!parent.valid() || ::fsync(parent.get()) < 0)
-        return OMError::fromErrno("fsync " + directory, errno);
+    OM_TRY(fillRandom(key));
+    auto made = Storage::writeFileAtomically(path, key, 0600, Storage::Existing::Keep);
+    if (!made.ok() && !(made.error().domain() == "POSIX" && made.error().code() == EEXIST))
+        return made.error();
     return {};
 }
 
