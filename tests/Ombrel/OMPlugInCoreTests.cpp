@@ -454,6 +454,18 @@ protected:
         return plugIn;
     }
 
+    // exportable() with every optional value too.
+    std::shared_ptr<OMPlugInCore> described()
+    {
+        auto plugIn = exportable();
+        plugIn->setLocalizedShortName("Share");
+        plugIn->setLocalizedName("Share It");
+        plugIn->setLocalizedContainingName("Notes");
+        plugIn->setContainingUrl(OMBundle::fileURL("/Apps/Notes.app"));
+        plugIn->setEntitlements(Value::dictionary({ { "com.orvex.x", true } }));
+        return plugIn;
+    }
+
     static std::vector<std::string> keysOf(const Value& form)
     {
         std::vector<std::string> keys;
@@ -489,14 +501,7 @@ TEST_F(OMPlugInCoreForm, ExportWritesTheBaseKeysInOrder)
 
 TEST_F(OMPlugInCoreForm, OptionalKeysFollowInTheirOrder)
 {
-    auto plugIn = exportable();
-    plugIn->setLocalizedShortName("Share");
-    plugIn->setLocalizedName("Share It");
-    plugIn->setLocalizedContainingName("Notes");
-    plugIn->setContainingUrl(OMBundle::fileURL("/Apps/Notes.app"));
-    plugIn->setEntitlements(Value::dictionary({ { "com.orvex.x", true } }));
-
-    const Value form = plugIn->exportForm();
+    const Value form = described()->exportForm();
 
     const auto keys = keysOf(form);
     ASSERT_EQ(keys.size(), 16u);
@@ -530,11 +535,7 @@ TEST_F(OMPlugInCoreForm, RecordMissingABaseValueIsNotExported)
 
 TEST_F(OMPlugInCoreForm, ReadingBackGivesTheSameRecord)
 {
-    auto plugIn = exportable();
-    plugIn->setLocalizedName("Share It");
-    plugIn->setLocalizedShortName("Share");
-    plugIn->setLocalizedContainingName("Notes");
-    plugIn->setContainingUrl(OMBundle::fileURL("/Apps/Notes.app"));
+    auto plugIn = described();
     plugIn->setAnnotation("election", 1);
     // What travels under "info" is not what the reader takes.
     plugIn->setPlugInDictionary(complete({ { "OnlyInInfo", true } }));
@@ -557,6 +558,7 @@ TEST_F(OMPlugInCoreForm, ReadingBackGivesTheSameRecord)
     EXPECT_EQ(read->localizedShortName(), "Share");
     EXPECT_EQ(read->localizedContainingName(), "Notes");
     EXPECT_EQ(read->containingUrl(), plugIn->containingUrl());
+    EXPECT_EQ(read->entitlements(), plugIn->entitlements());
     EXPECT_EQ(read->annotations(), Value::dictionary({ { "election", 1 } }));
     EXPECT_EQ(read->plugInDictionary(), complete());
     EXPECT_EQ(read->cdhash(), std::vector<uint8_t>(20, 7));
