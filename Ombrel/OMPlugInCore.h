@@ -148,7 +148,8 @@ public:
     void resolveSDK();
     // The SDK entry of an extension point, or none (logged).
     static Value readSDKDictionary(std::string_view name);
-    // sdk merged into plugIn by the DictionaryMerge rules with this record's sdkOverridesKey.
+    // sdk merged into the plug-in side by the DictionaryMerge rules, with this record's
+    // sdkOverridesKey deciding which keys the SDK's value wins.
     Value mergeDictionary(const Value& sdk, const Value& into) const;
     // True for the keys whose SDK value replaces the plug-in's.
     virtual bool sdkOverridesKey(std::string_view key) const;

@@ -12,6 +12,8 @@ namespace {
 
 bool isWithin(const std::string& path, const std::string& directory)
 {
+    if (directory == "/")
+        return true;
     return path == directory || (path.starts_with(directory) && path[directory.size()] == '/');
 }
 
