@@ -116,7 +116,8 @@ Result<void> Storage::makeDirectories(const std::string& path, unsigned mode)
     return {};
 }
 
-Result<void> Storage::writeFileAtomically(const std::string& path, std::span<const uint8_t> bytes, unsigned mode)
+Result<void> Storage::writeFileAtomically(
+    const std::string& path, std::span<const uint8_t> bytes, unsigned mode, Existing existing)
 {
     const std::string directory = directoryOf(path);
     const std::string temporary = path + ".tmp-" + Uuid::random().string();
@@ -132,8 +133,16 @@ Result<void> Storage::writeFileAtomically(const std::string& path, std::span<con
     if (::fsync(file.get()) < 0)
         return fail(OMError::fromErrno("fsync " + temporary, errno));
     file.reset();
-    if (::rename(temporary.c_str(), path.c_str()) < 0)
+    if (existing == Existing::Keep) {
+        // link() never replaces: it fails with EEXIST where rename() would have taken the name.
+        const int linked = ::link(temporary.c_str(), path.c_str());
+        const int error = errno;
+        (void)::unlink(temporary.c_str()); // the new file, if linked, lives on under path
+        if (linked < 0)
+            return OMError::fromErrno("link " + path, error);
+    } else if (::rename(temporary.c_str(), path.c_str()) < 0) {
         return fail(OMError::fromErrno("rename " + temporary, errno));
+    }
     UniqueFd parent(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (!parent.valid())
         return OMError::fromErrno("open " + directory, errno);

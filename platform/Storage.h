@@ -38,11 +38,14 @@ public:
 
     // mkdir -p, with mode for the directories it makes.
     static Result<void> makeDirectories(const std::string& path, unsigned mode = 0755);
+    enum class Existing : uint8_t { Replace, Keep };
     // Replaces the file at path with bytes so that a crash at any moment leaves either the old or
     // the new contents: a temporary file in the same directory, fsync, rename, fsync of the
-    // directory. The file gets mode (before umask) when it is made.
-    static Result<void> writeFileAtomically(
-        const std::string& path, std::span<const uint8_t> bytes, unsigned mode = 0644);
+    // directory. The file gets mode (before umask) when it is made. With Existing::Keep a file
+    // already at path stays as it is and the call fails with EEXIST, so that of several writers
+    // racing to make one file, exactly one succeeds and nobody ever sees a partial one.
+    static Result<void> writeFileAtomically(const std::string& path, std::span<const uint8_t> bytes,
+        unsigned mode = 0644, Existing existing = Existing::Replace);
 };
 
 } // namespace om

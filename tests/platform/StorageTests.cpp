@@ -86,3 +86,20 @@ TEST(Storage, AFailedWriteKeepsWhatWasThereAndCleansUp)
         ++entries;
     EXPECT_EQ(entries, 1u);
 }
+
+TEST(Storage, KeepingWriteNeverReplacesAndLeavesNothingBehind)
+{
+    om::test::BundleFixture fixture;
+    const std::string path = fixture.root() + "/key";
+
+    ASSERT_TRUE(Storage::writeFileAtomically(path, bytesOf("first"), 0600, Storage::Existing::Keep).ok());
+    auto second = Storage::writeFileAtomically(path, bytesOf("second"), 0600, Storage::Existing::Keep);
+
+    ASSERT_FALSE(second.ok());
+    EXPECT_EQ(second.error().code(), EEXIST);
+    EXPECT_EQ(contentsOf(path), "first");
+    size_t entries = 0;
+    for ([[maybe_unused]] const auto& entry : std::filesystem::directory_iterator(fixture.root()))
+        ++entries;
+    EXPECT_EQ(entries, 1u);
+}
