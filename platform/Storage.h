@@ -6,10 +6,14 @@
 // temporary directory.
 #pragma once
 
+#include <sys/stat.h>
+
+#include <cstdint>
 #include <optional>
 #include <span>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/Result.h"
 
@@ -43,6 +47,11 @@ public:
     // directory. The file gets mode (before umask) when it is made.
     static Result<void> writeFileAtomically(
         const std::string& path, std::span<const uint8_t> bytes, unsigned mode = 0644);
+    // Reads a whole regular file of at most maxBytes, however it grows while being read; a FIFO or
+    // device put in its place fails at once instead of blocking. status, when given, receives the
+    // fstat() of the file that was read.
+    static Result<std::vector<uint8_t>> readFile(
+        const std::string& path, size_t maxBytes, struct stat* status = nullptr);
 };
 
 } // namespace om

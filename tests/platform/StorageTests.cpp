@@ -86,3 +86,48 @@ TEST(Storage, AFailedWriteKeepsWhatWasThereAndCleansUp)
         ++entries;
     EXPECT_EQ(entries, 1u);
 }
+
+TEST(Storage, AtomicWriteTakesTheLongestFileName)
+{
+    om::test::BundleFixture fixture;
+    for (const size_t length : { size_t(255), size_t(256) }) {
+        const std::string path = fixture.root() + "/" + std::string(length, 'n');
+        EXPECT_EQ(Storage::writeFileAtomically(path, bytesOf("contents")).ok(), length <= 255) << length;
+    }
+    EXPECT_EQ(contentsOf(fixture.root() + "/" + std::string(255, 'n')), "contents");
+}
+
+TEST(Storage, ReadFileTakesRegularFilesUpToTheLimit)
+{
+    om::test::BundleFixture fixture;
+    const std::string path = fixture.writeFile("file", "0123456789");
+    struct stat info { };
+    auto whole = Storage::readFile(path, 10, &info);
+    ASSERT_TRUE(whole.ok());
+    EXPECT_EQ(std::string(whole->begin(), whole->end()), "0123456789");
+    EXPECT_EQ(info.st_size, 10);
+
+    auto over = Storage::readFile(path, 9);
+    ASSERT_FALSE(over.ok());
+    EXPECT_EQ(over.error().code(), om::kPlatformErrorLimit);
+    EXPECT_NE(over.error().localizedDescription().find(path), std::string::npos);
+
+    auto missing = Storage::readFile(fixture.root() + "/missing", 10);
+    ASSERT_FALSE(missing.ok());
+    EXPECT_EQ(missing.error().domain(), "POSIX");
+    EXPECT_EQ(missing.error().code(), ENOENT);
+}
+
+// Something other than a regular file in the way fails at once: a FIFO with no writer would
+// otherwise block the reader for good.
+TEST(Storage, ReadFileRefusesWhatIsNoRegularFile)
+{
+    om::test::BundleFixture fixture;
+    const std::string fifo = fixture.root() + "/fifo";
+    ASSERT_EQ(::mkfifo(fifo.c_str(), 0600), 0);
+    for (const std::string& path : { fifo, fixture.root(), std::string("/dev/zero") }) {
+        auto read = Storage::readFile(path, 1 << 20);
+        ASSERT_FALSE(read.ok()) << path;
+        EXPECT_EQ(read.error().code(), om::kPlatformErrorUnsupported) << path;
+    }
+}
