@@ -57,6 +57,11 @@ struct Case {
     bool accepted;
 };
 
+Value ruleOf(std::initializer_list<Value::Entry> entries)
+{
+    return Value::dictionary(entries);
+}
+
 // "application/octet-stream" spelled in the n-th of its many letter cases: distinct rule keys for
 // one and the same type.
 std::string octetStreamSpelling(size_t n)
@@ -77,26 +82,24 @@ std::string octetStreamSpelling(size_t n)
 TEST_F(ActivationRuleTest, CountsAndConformance)
 {
     const Case cases[] = {
-        { "one item of the type", Value::dictionary({ { "image/png", 1 } }), { "image/png" }, true },
-        { "one item of a subtype", Value::dictionary({ { "image/x-picture", 1 } }), { "image/jpeg" }, true },
-        { "a supertype item does not fit a subtype", Value::dictionary({ { "image/png", 1 } }), { "image/x-raster" },
+        { "one item of the type", ruleOf({ { "image/png", 1 } }), { "image/png" }, true },
+        { "one item of a subtype", ruleOf({ { "image/x-picture", 1 } }), { "image/jpeg" }, true },
+        { "a supertype item does not fit a subtype", ruleOf({ { "image/png", 1 } }), { "image/x-raster" }, false },
+        { "2 accepted, 2 offered", ruleOf({ { "image/x-raster", 2 } }), { "image/png", "image/jpeg" }, true },
+        { "2 accepted, 3 offered", ruleOf({ { "image/x-raster", 2 } }), { "image/png", "image/jpeg", "image/png" },
             false },
-        { "2 accepted, 2 offered", Value::dictionary({ { "image/x-raster", 2 } }), { "image/png", "image/jpeg" },
-            true },
-        { "2 accepted, 3 offered", Value::dictionary({ { "image/x-raster", 2 } }),
-            { "image/png", "image/jpeg", "image/png" }, false },
-        { "no items", Value::dictionary({ { "image/png", 5 } }), {}, false },
-        { "an unknown item type", Value::dictionary({ { "image/png", 5 } }), { "video/x-unknown" }, false },
-        { "one item fits, the other does not", Value::dictionary({ { "image/x-raster", 5 } }),
-            { "image/png", "image/gif" }, false },
-        { "an empty rule", Value::dictionary({}), { "image/png" }, false },
-        { "octet-stream takes anything", Value::dictionary({ { "application/octet-stream", 3 } }),
+        { "no items", ruleOf({ { "image/png", 5 } }), {}, false },
+        { "an unknown item type", ruleOf({ { "image/png", 5 } }), { "video/x-unknown" }, false },
+        { "one item fits, the other does not", ruleOf({ { "image/x-raster", 5 } }), { "image/png", "image/gif" },
+            false },
+        { "an empty rule", ruleOf({}), { "image/png" }, false },
+        { "octet-stream takes anything", ruleOf({ { "application/octet-stream", 3 } }),
             { "image/gif", "text/x-note", "video/x-unknown" }, true },
-        { "octet-stream counts too", Value::dictionary({ { "application/octet-stream", 3 } }),
+        { "octet-stream counts too", ruleOf({ { "application/octet-stream", 3 } }),
             { "image/gif", "text/x-note", "video/x-unknown", "image/png" }, false },
-        { "text/plain takes text", Value::dictionary({ { "text/plain", 1 } }), { "text/x-note" }, true },
-        { "case and aliases", Value::dictionary({ { "IMAGE/JPEG", 1 } }), { "Image/PJpeg" }, true },
-        { "one rule type's room is not another's", Value::dictionary({ { "image/png", 1 }, { "image/gif", 1 } }),
+        { "text/plain takes text", ruleOf({ { "text/plain", 1 } }), { "text/x-note" }, true },
+        { "case and aliases", ruleOf({ { "IMAGE/JPEG", 1 } }), { "Image/PJpeg" }, true },
+        { "one rule type's room is not another's", ruleOf({ { "image/png", 1 }, { "image/gif", 1 } }),
             { "image/png", "image/png" }, false },
     };
     for (const auto& test : cases)
@@ -107,9 +110,8 @@ TEST_F(ActivationRuleTest, CountsAndConformance)
 // first rule type with room fails these, although an assignment exists (or, last, does not).
 TEST_F(ActivationRuleTest, ItemsAreSharedOutExactlyNotGreedily)
 {
-    const Value rasterThenPng = Value::dictionary({ { "image/x-raster", 1 }, { "image/png", 1 } });
-    const Value pictureRasterPng
-        = Value::dictionary({ { "image/x-picture", 1 }, { "image/x-raster", 1 }, { "image/png", 1 } });
+    const Value rasterThenPng = ruleOf({ { "image/x-raster", 1 }, { "image/png", 1 } });
+    const Value pictureRasterPng = ruleOf({ { "image/x-picture", 1 }, { "image/x-raster", 1 }, { "image/png", 1 } });
     const Case cases[] = {
         { "png first", rasterThenPng, { "image/png", "image/jpeg" }, true },
         { "jpeg first", rasterThenPng, { "image/jpeg", "image/png" }, true },
@@ -131,22 +133,17 @@ TEST_F(ActivationRuleTest, WhatARuleValueAccepts)
         size_t mostAccepted; // of up to 3 items
     } cases[] = {
         { "2", Value(2), 2 },
-        { "unsigned 2", Value(2u), 2 },
         { "0", Value(0), 0 },
         { "-1", Value(-1), 0 },
-        { "INT64_MIN", Value(std::numeric_limits<int64_t>::min()), 0 },
         { "UINT64_MAX", Value(std::numeric_limits<uint64_t>::max()), 3 },
         { "1.9 is truncated", Value(1.9), 1 },
         { "2.0", Value(2.0), 2 },
         { "0.5", Value(0.5), 0 },
-        { "-0.5", Value(-0.5), 0 },
         { "NaN", Value(nan), 0 },
         { "1e300", Value(1e300), 3 },
-        { "infinity", Value(std::numeric_limits<double>::infinity()), 3 },
         { "the string 2", Value("2"), 0 },
         { "true", Value(true), 0 },
         { "an array", Value::array({ 2 }), 0 },
-        { "a dictionary", Value::dictionary({ { "count", 2 } }), 0 },
     };
     for (const auto& test : cases) {
         const Value rule = Value::dictionary({ { "image/png", test.accepts } });
@@ -167,13 +164,10 @@ TEST_F(ActivationRuleTest, MalformedInputIsNo)
     } cases[] = {
         { "rule is none", Value(), items({ "image/png" }) },
         { "rule is an array", Value::array({ "image/png" }), items({ "image/png" }) },
-        { "rule is a string", Value("image/png"), items({ "image/png" }) },
         { "items are none", rule, Value() },
-        { "items are an array", rule, Value::array({ "image/png" }) },
         { "no types key", rule, Value::dictionary({ { "kinds", Value::array({ "image/png" }) } }) },
         { "types is a string", rule, Value::dictionary({ { "types", "image/png" } }) },
         { "a type is a number", rule, Value::dictionary({ { "types", Value::array({ "image/png", 7 }) } }) },
-        { "a type is a dictionary", rule, Value::dictionary({ { "types", Value::array({ Value::dictionary({}) }) } }) },
         { "a type is no type", rule, items({ "image/png", "not-a-type" }) },
         { "a type is too long", rule, items({ "image/" + std::string(250, 'x') }) },
     };
@@ -182,19 +176,15 @@ TEST_F(ActivationRuleTest, MalformedInputIsNo)
     EXPECT_TRUE(evaluate(rule, Value::dictionary({ { "types", Value::array({ "image/png" }) }, { "extra", 1 } })));
 }
 
-TEST_F(ActivationRuleTest, ItemCountIsBounded)
+TEST_F(ActivationRuleTest, ItemsAndRuleTypesAreBounded)
 {
-    const Value rule = Value::dictionary({ { "image/png", 5000 } });
-    EXPECT_TRUE(evaluate(rule, items(std::vector<std::string>(ActivationRule::kMaxItems, "image/png"))));
-    EXPECT_FALSE(evaluate(rule, items(std::vector<std::string>(ActivationRule::kMaxItems + 1, "image/png"))));
-}
+    const Value roomy = Value::dictionary({ { "image/png", 5000 } });
+    EXPECT_TRUE(evaluate(roomy, items(std::vector<std::string>(ActivationRule::kMaxItems, "image/png"))));
+    EXPECT_FALSE(evaluate(roomy, items(std::vector<std::string>(ActivationRule::kMaxItems + 1, "image/png"))));
 
-TEST_F(ActivationRuleTest, RuleSizeIsBounded)
-{
-    std::vector<Value::Entry> entries;
-    for (size_t i = 0; i + 1 < ActivationRule::kMaxRuleTypes; ++i)
-        entries.emplace_back("video/x-filler-" + std::to_string(i), 1);
-    entries.emplace_back("image/png", 1);
+    std::vector<Value::Entry> entries { { "image/png", 1 } };
+    while (entries.size() < ActivationRule::kMaxRuleTypes)
+        entries.emplace_back("video/x-filler-" + std::to_string(entries.size()), 1);
     EXPECT_TRUE(evaluate(Value::dictionary(entries), items({ "image/png" })));
     entries.emplace_back("video/x-one-too-many", 1);
     EXPECT_FALSE(evaluate(Value::dictionary(entries), items({ "image/png" })));

@@ -22,7 +22,8 @@
 #include "platform/Storage.h"
 #include "platform/UniqueFd.h"
 #include "platform/WorkQueue.h"
-#include "tests/platform/PrivateBus.h"
+#include "tests/support/BundleFixture.h"
+#include "tests/support/DaemonProcess.h"
 
 using om::Log;
 using om::LogLevel;
@@ -33,33 +34,6 @@ namespace {
 
 // Long enough that only a broken bus or a lost notification reaches it.
 constexpr auto kGenerous = std::chrono::seconds(60);
-
-// Sets an environment variable for the life of the object, then puts back what was there. The
-// poster reads the bus address only while it connects; callers make sure it is idle (flush()).
-class ScopedEnvironment {
-public:
-    ScopedEnvironment(const char* name, const std::string& value)
-        : m_name(name)
-        , m_saved(om::Storage::environment(name))
-    {
-        set(value);
-    }
-    ~ScopedEnvironment()
-    {
-        if (m_saved)
-            ::setenv(m_name, m_saved->c_str(), 1);
-        else
-            ::unsetenv(m_name);
-    }
-    ScopedEnvironment(const ScopedEnvironment&) = delete;
-    ScopedEnvironment& operator=(const ScopedEnvironment&) = delete;
-
-    void set(const std::string& value) { ::setenv(m_name, value.c_str(), 1); }
-
-private:
-    const char* m_name;
-    std::optional<std::string> m_saved;
-};
 
 // What the handlers of a test received, in order.
 class Received {
@@ -89,36 +63,65 @@ private:
     std::vector<std::string> m_names;
 };
 
-// Counts the records of the notify category that say name was not posted.
-size_t notPostedLines(const Log::Capture& capture, const std::string& name)
+// Records of the notify category at level, or (level none) saying that name was not posted.
+size_t lines(const Log::Capture& capture, std::optional<LogLevel> level, const std::string& name = {})
 {
     const std::string phrase = "notification " + name + " not posted";
     size_t count = 0;
-    for (const auto& record : capture.records())
-        count += record.category == "notify" && record.message.find(phrase) != std::string::npos;
+    for (const auto& record : capture.records()) {
+        count += record.category == "notify"
+            && (level ? record.level == *level : record.message.find(phrase) != std::string::npos);
+    }
     return count;
 }
 
-size_t linesAt(const Log::Capture& capture, LogLevel level)
-{
-    size_t count = 0;
-    for (const auto& record : capture.records())
-        count += record.category == "notify" && record.level == level;
-    return count;
-}
-
+// Each test has a message bus of its own: dbus-daemon with the session configuration on a socket in
+// the test's directory, so that a test run by hand needs no session bus and a run under
+// dbus-run-session shares none. The poster reads the bus address only while it connects, so the
+// environment changes only once the poster is idle (flush()).
 class NotifyTest : public ::testing::Test {
 protected:
     void SetUp() override
     {
-        ASSERT_FALSE(m_bus.address().empty()) << "dbus-daemon did not start";
-        Notify::flush(); // the poster is idle before the environment changes
-        m_environment.emplace("DBUS_SESSION_BUS_ADDRESS", m_bus.address());
+        m_address = startBus(m_bus, "bus");
+        ASSERT_FALSE(m_address.empty()) << "dbus-daemon did not start";
+        m_savedAddress = om::Storage::environment("DBUS_SESSION_BUS_ADDRESS");
+        moveBusTo(m_address);
     }
     void TearDown() override
     {
         Notify::flush();
-        m_environment.reset();
+        if (m_savedAddress)
+            ::setenv("DBUS_SESSION_BUS_ADDRESS", m_savedAddress->c_str(), 1);
+        else
+            ::unsetenv("DBUS_SESSION_BUS_ADDRESS");
+    }
+
+    // The address the bus prints on standard error once it listens; empty when it did not start.
+    std::string startBus(std::unique_ptr<om::test::DaemonProcess>& bus, const std::string& socketName)
+    {
+        bus = std::make_unique<om::test::DaemonProcess>(om::test::DaemonProcess::Options {
+            .executable = "/usr/bin/dbus-daemon",
+            .arguments = { "--session", "--nofork", "--address=unix:path=" + m_fixture.root() + "/" + socketName,
+                "--print-address=2" },
+            .logLevel = "",
+            .privateDatabase = false,
+        });
+        std::string address;
+        bus->waitForLines([&](const auto& lines) {
+            for (const auto& line : lines) {
+                if (line.raw.starts_with("unix:"))
+                    address = line.raw;
+            }
+            return !address.empty();
+        });
+        return address;
+    }
+
+    void moveBusTo(const std::string& address)
+    {
+        Notify::flush();
+        ::setenv("DBUS_SESSION_BUS_ADDRESS", address.c_str(), 1);
     }
 
     std::unique_ptr<NotifyListener> listen(std::vector<std::string> names, Received& received)
@@ -128,31 +131,14 @@ protected:
         return listener.ok() ? std::move(listener).releaseValue() : nullptr;
     }
 
-    // Points the poster at another address, once it has finished what it was doing.
-    void moveBusTo(const std::string& address)
-    {
-        Notify::flush();
-        m_environment->set(address);
-    }
-
-    om::test::PrivateBus m_bus;
-    std::optional<ScopedEnvironment> m_environment;
+    om::test::BundleFixture m_fixture;
+    std::unique_ptr<om::test::DaemonProcess> m_bus;
+    std::string m_address;
+    std::optional<std::string> m_savedAddress;
     const std::shared_ptr<om::WorkQueue> m_queue = om::WorkQueue::create("com.orvex.test.notify");
 };
 
 } // namespace
-
-TEST_F(NotifyTest, AListenerReceivesAPostedName)
-{
-    Received received;
-    auto listener = listen({ "com.orvex.test.changed" }, received);
-    ASSERT_TRUE(listener);
-
-    Notify::post("com.orvex.test.changed");
-
-    ASSERT_TRUE(received.waitForCount(1));
-    EXPECT_EQ(received.names(), std::vector<std::string> { "com.orvex.test.changed" });
-}
 
 // The poster sends in order and the bus delivers in order, so by the time the wanted name has
 // arrived, the ones posted before it would have too.
@@ -223,7 +209,7 @@ TEST_F(NotifyTest, PostsFromManyThreadsAllArrive)
 
 TEST_F(NotifyTest, WithoutABusEachPostIsLoggedOnceAtDebugLevel)
 {
-    moveBusTo("unix:path=" + m_bus.root() + "/no-such-socket");
+    moveBusTo("unix:path=" + m_fixture.root() + "/no-such-socket");
     Log::Capture capture;
 
     for (const char* name : { "com.orvex.test.one", "com.orvex.test.two", "com.orvex.test.three" })
@@ -231,12 +217,12 @@ TEST_F(NotifyTest, WithoutABusEachPostIsLoggedOnceAtDebugLevel)
     Notify::flush();
 
     for (const char* name : { "com.orvex.test.one", "com.orvex.test.two", "com.orvex.test.three" })
-        EXPECT_EQ(notPostedLines(capture, name), 1u) << name;
-    EXPECT_EQ(linesAt(capture, LogLevel::Debug), 3u);
-    EXPECT_EQ(linesAt(capture, LogLevel::Error), 0u);
+        EXPECT_EQ(lines(capture, std::nullopt, name), 1u) << name;
+    EXPECT_EQ(lines(capture, LogLevel::Debug), 3u);
+    EXPECT_EQ(lines(capture, LogLevel::Error), 0u);
 
     Received received; // the same poster reaches a bus again once there is one
-    moveBusTo(m_bus.address());
+    moveBusTo(m_address);
     auto listener = listen({ "com.orvex.test.back" }, received);
     Notify::post("com.orvex.test.back");
     EXPECT_TRUE(received.waitForCount(1));
@@ -247,7 +233,7 @@ TEST_F(NotifyTest, WithoutABusEachPostIsLoggedOnceAtDebugLevel)
 // rest is dropped with one error line.
 TEST_F(NotifyTest, AStalledBusHoldsOnlyThePosterAndABoundedQueue)
 {
-    const std::string socketPath = m_bus.root() + "/stalled";
+    const std::string socketPath = m_fixture.root() + "/stalled";
     om::UniqueFd server(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
     sockaddr_un address {};
     address.sun_family = AF_UNIX;
@@ -269,21 +255,21 @@ TEST_F(NotifyTest, AStalledBusHoldsOnlyThePosterAndABoundedQueue)
     Notify::post("com.orvex.test.n7");
     Notify::post("com.orvex.test.dropped1");
     Notify::post("com.orvex.test.dropped2");
-    EXPECT_EQ(linesAt(capture, LogLevel::Error), 1u);
+    EXPECT_EQ(lines(capture, LogLevel::Error), 1u);
 
     connection.reset(); // the poster sees the hang-up; everything after finds no bus
     server.reset();
     ASSERT_EQ(::unlink(socketPath.c_str()), 0);
     Notify::flush();
 
-    EXPECT_EQ(notPostedLines(capture, "com.orvex.test.first"), 1u);
-    EXPECT_EQ(notPostedLines(capture, "com.orvex.test.n0"), 1u);
-    EXPECT_EQ(notPostedLines(capture, "com.orvex.test.n7"), 1u);
-    EXPECT_EQ(notPostedLines(capture, "com.orvex.test.n" + std::to_string(Notify::kMaxPending - 1)), 1u);
-    EXPECT_EQ(notPostedLines(capture, "com.orvex.test.dropped1"), 0u);
-    EXPECT_EQ(notPostedLines(capture, "com.orvex.test.dropped2"), 0u);
-    EXPECT_EQ(linesAt(capture, LogLevel::Debug), 1 + Notify::kMaxPending);
-    EXPECT_EQ(linesAt(capture, LogLevel::Error), 1u);
+    EXPECT_EQ(lines(capture, std::nullopt, "com.orvex.test.first"), 1u);
+    EXPECT_EQ(lines(capture, std::nullopt, "com.orvex.test.n0"), 1u);
+    EXPECT_EQ(lines(capture, std::nullopt, "com.orvex.test.n7"), 1u);
+    EXPECT_EQ(lines(capture, std::nullopt, "com.orvex.test.n" + std::to_string(Notify::kMaxPending - 1)), 1u);
+    EXPECT_EQ(lines(capture, std::nullopt, "com.orvex.test.dropped1"), 0u);
+    EXPECT_EQ(lines(capture, std::nullopt, "com.orvex.test.dropped2"), 0u);
+    EXPECT_EQ(lines(capture, LogLevel::Debug), 1 + Notify::kMaxPending);
+    EXPECT_EQ(lines(capture, LogLevel::Error), 1u);
 }
 
 // The poster keeps its connection between posts; when the bus behind it went away, the next post
@@ -297,10 +283,11 @@ TEST_F(NotifyTest, ThePosterReconnectsAfterTheBusRestarts)
         ASSERT_TRUE(before.waitForCount(1));
     }
     Notify::flush();
-    m_bus.stop();
-    om::test::PrivateBus restarted;
-    ASSERT_FALSE(restarted.address().empty());
-    moveBusTo(restarted.address());
+    ASSERT_TRUE(m_bus->stop().has_value());
+    std::unique_ptr<om::test::DaemonProcess> restarted;
+    const std::string address = startBus(restarted, "restarted");
+    ASSERT_FALSE(address.empty());
+    moveBusTo(address);
     Log::Capture capture;
 
     Received after;
@@ -309,7 +296,7 @@ TEST_F(NotifyTest, ThePosterReconnectsAfterTheBusRestarts)
     Notify::post("com.orvex.test.restart");
 
     ASSERT_TRUE(after.waitForCount(1));
-    EXPECT_EQ(notPostedLines(capture, "com.orvex.test.restart"), 0u);
+    EXPECT_EQ(lines(capture, std::nullopt, "com.orvex.test.restart"), 0u);
 }
 
 TEST_F(NotifyTest, AListenerMayEndItselfFromItsHandler)
@@ -339,19 +326,16 @@ TEST_F(NotifyTest, AListenerMayEndItselfFromItsHandler)
 TEST_F(NotifyTest, ListenersRefuseWhatCannotBeSubscribed)
 {
     Received received;
-    std::vector<std::string> tooMany;
-    for (size_t i = 0; i <= NotifyListener::kMaxNames; ++i)
-        tooMany.push_back("com.orvex.test.n" + std::to_string(i));
-    const std::vector<std::string> justEnough(tooMany.begin(), tooMany.end() - 1);
-
-    EXPECT_TRUE(NotifyListener::create(justEnough, m_queue, received.handler()).ok());
-    EXPECT_FALSE(NotifyListener::create(tooMany, m_queue, received.handler()).ok());
+    std::vector<std::string> names;
+    while (names.size() < NotifyListener::kMaxNames)
+        names.push_back("com.orvex.test.n" + std::to_string(names.size()));
+    EXPECT_TRUE(NotifyListener::create(names, m_queue, received.handler()).ok());
+    names.push_back("com.orvex.test.one-too-many");
+    EXPECT_FALSE(NotifyListener::create(names, m_queue, received.handler()).ok());
     EXPECT_FALSE(NotifyListener::create(std::vector<std::string> {}, m_queue, received.handler()).ok());
     EXPECT_FALSE(NotifyListener::create("has space", m_queue, received.handler()).ok());
-    EXPECT_FALSE(NotifyListener::create("com.orvex.test.ok", nullptr, received.handler()).ok());
-    EXPECT_FALSE(NotifyListener::create("com.orvex.test.ok", m_queue, nullptr).ok());
 
-    moveBusTo("unix:path=" + m_bus.root() + "/no-such-socket");
+    moveBusTo("unix:path=" + m_fixture.root() + "/no-such-socket");
     auto unreachable = NotifyListener::create("com.orvex.test.ok", m_queue, received.handler());
     ASSERT_FALSE(unreachable.ok());
     EXPECT_NE(unreachable.error().localizedDescription().find("sd_bus_open"), std::string::npos);
@@ -368,24 +352,18 @@ TEST(NotifyNames, AreMatchRuleValuesAsTheyStand)
         { longest, true },
         { longest + "n", false },
         { "", false },
-        { "x", true },
         { "with space", false },
         { "quote'd", false },
         { "back\\slash", false },
-        { "tab\there", false },
         { "caf\xc3\xa9", false },
-        { std::string("nul\0", 4), false },
         { "~!#$%&()*+,-./:;<=>?@[]^_`{|}", true },
     };
     for (const auto& test : cases)
         EXPECT_EQ(Notify::isValidName(test.name), test.valid) << test.name;
-}
 
-TEST(NotifyNames, AnInvalidNameIsLoggedAndNotPosted)
-{
     Log::Capture capture;
     Notify::post("not valid");
     Notify::flush();
-    EXPECT_EQ(linesAt(capture, LogLevel::Error), 1u);
-    EXPECT_EQ(notPostedLines(capture, "not valid"), 0u);
+    EXPECT_EQ(lines(capture, LogLevel::Error), 1u);
+    EXPECT_EQ(lines(capture, std::nullopt, "not valid"), 0u);
 }

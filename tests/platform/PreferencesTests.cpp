@@ -45,6 +45,12 @@ protected:
         om::test::BundleFixture::writeFileAt(path(domain), text);
     }
 
+    std::string contents() const
+    {
+        auto bytes = om::Storage::readFile(path(), Preferences::kMaxFileSize);
+        return bytes.ok() ? std::string(bytes->begin(), bytes->end()) : std::string();
+    }
+
     static size_t errorsLogged(const Log::Capture& capture)
     {
         size_t count = 0;
@@ -90,31 +96,21 @@ void rewriteInPlaceKeepingTimes(const std::string& path, std::string_view text, 
 
 } // namespace
 
-TEST_F(PreferencesTest, AMissingFileOrDirectoryIsAnEmptyDomain)
+TEST_F(PreferencesTest, AChangedFileIsReadAgainWhenSynchronised)
 {
     Log::Capture capture;
     Preferences preferences(directory());
     ASSERT_TRUE(preferences.addSuiteNamed(kDomain).ok());
-    EXPECT_TRUE(preferences.synchronizedValueForKey("exclusions").isNone());
-    EXPECT_EQ(errorsLogged(capture), 0u);
+    EXPECT_TRUE(preferences.synchronizedValueForKey("key").isNone()); // no directory, no file
 
-    replace(one("exclusions", Value::array({ Value::dictionary({}) })));
-    EXPECT_EQ(preferences.synchronizedValueForKey("exclusions").count(), 1u);
-}
-
-TEST_F(PreferencesTest, AReplacedFileIsReadAgainAndOnlyWhenSynchronised)
-{
     replace(one("key", 1));
-    Preferences preferences(directory());
-    ASSERT_TRUE(preferences.addSuiteNamed(kDomain).ok());
     EXPECT_EQ(preferences.synchronizedValueForKey("key"), Value(1));
-
     replace(one("key", 2));
     EXPECT_EQ(preferences.valueForKey("key"), Value(1)); // what was read, until synchronised
     EXPECT_EQ(preferences.synchronizedValueForKey("key"), Value(2));
-
     ASSERT_EQ(::unlink(path().c_str()), 0);
     EXPECT_TRUE(preferences.synchronizedValueForKey("key").isNone());
+    EXPECT_EQ(errorsLogged(capture), 0u);
 }
 
 // Changes that a check of the modification time alone would miss: the same size, the same
@@ -221,14 +217,11 @@ TEST_F(PreferencesTest, DomainNamesMustNameOneFile)
         std::string domain;
         bool valid;
     } cases[] = {
-        { "com.orvex.ombrel.userprefs", true },
         { longest, true },
         { longest + "d", false },
         { "", false },
-        { ".", false },
         { "..", false },
         { "a/b", false },
-        { "../escape", false },
         { std::string("nul\0byte", 8), false },
     };
     Preferences preferences(directory());
@@ -238,7 +231,7 @@ TEST_F(PreferencesTest, DomainNamesMustNameOneFile)
     }
 }
 
-TEST_F(PreferencesTest, SetValueRewritesTheWholeFileAsXml)
+TEST_F(PreferencesTest, SetValueRewritesTheWholeFileButNeverADamagedOne)
 {
     Preferences preferences(directory());
     ASSERT_TRUE(preferences.setValue(kDomain, "kept", "yes").ok()); // makes the directory too
@@ -246,24 +239,12 @@ TEST_F(PreferencesTest, SetValueRewritesTheWholeFileAsXml)
     ASSERT_TRUE(preferences.setValue(kDomain, "changed", 2).ok());
     ASSERT_TRUE(preferences.setValue(kDomain, "removed", true).ok());
     ASSERT_TRUE(preferences.setValue(kDomain, "removed", Value()).ok());
+    const Value expected = Value::dictionary({ { "kept", "yes" }, { "changed", 2 } });
+    EXPECT_EQ(contents(), om::Vlist::writeXml(expected));
 
-    auto stored = om::Vlist::readFile(path());
-    ASSERT_TRUE(stored.ok());
-    EXPECT_EQ(*stored, Value::dictionary({ { "kept", "yes" }, { "changed", 2 } }));
-    std::string text(om::Vlist::writeXml(*stored));
-    auto bytes = om::Storage::readFile(path(), 1 << 20);
-    ASSERT_TRUE(bytes.ok());
-    EXPECT_EQ(std::string(bytes->begin(), bytes->end()), text);
-}
-
-TEST_F(PreferencesTest, SetValueLeavesADamagedFileAlone)
-{
     replaceText("not a vlist");
-    Preferences preferences(directory());
     EXPECT_FALSE(preferences.setValue(kDomain, "key", 1).ok());
-    auto bytes = om::Storage::readFile(path(), 1 << 20);
-    ASSERT_TRUE(bytes.ok());
-    EXPECT_EQ(std::string(bytes->begin(), bytes->end()), "not a vlist");
+    EXPECT_EQ(contents(), "not a vlist");
 }
 
 TEST(PreferencesLocation, PrefsDirDecidesElseTheUsersConfigurationOrEtc)

@@ -13,7 +13,19 @@ using om::TypeConformance;
 
 namespace {
 
-// A private database: <root>/high and <root>/low, in that order of precedence.
+struct Case {
+    std::string type;
+    std::string to;
+    bool conforms;
+};
+
+void expectCases(const TypeConformance& database, const std::vector<Case>& cases)
+{
+    for (const auto& test : cases)
+        EXPECT_EQ(database.conforms(test.type, test.to), test.conforms) << test.type << " -> " << test.to;
+}
+
+// A private database in two data directories, <root>/high taking precedence over <root>/low.
 class TypeDatabase : public ::testing::Test {
 protected:
     void SetUp() override
@@ -29,9 +41,7 @@ protected:
             "Upper/Case Upper/PARENT\n"
             "application/x-script text/x-source\n"
             "application/x-kid old/name\n");
-        writeMime("high", "aliases",
-            "old/name new/name\n"
-            "shadowed/alias high/target\n");
+        writeMime("high", "aliases", "old/name new/name\nshadowed/alias high/target\n");
         writeMime("low", "subclasses", "new/name base/type\n");
         writeMime("low", "aliases", "shadowed/alias low/target\n");
     }
@@ -40,7 +50,6 @@ protected:
     {
         m_fixture.writeFile(directory + "/mime/" + file, text);
     }
-
     TypeConformance database() const
     {
         return TypeConformance::fromDirectories({ m_fixture.root() + "/high", m_fixture.root() + "/low" });
@@ -49,129 +58,64 @@ protected:
     om::test::BundleFixture m_fixture;
 };
 
-struct Case {
-    const char* type;
-    const char* to;
-    bool conforms;
-};
-
-void expectCases(const TypeConformance& database, std::initializer_list<Case> cases)
-{
-    for (const auto& test : cases)
-        EXPECT_EQ(database.conforms(test.type, test.to), test.conforms) << test.type << " -> " << test.to;
-}
-
 } // namespace
 
-TEST_F(TypeDatabase, SubclassesConformTransitivelyAndOnlyUpwards)
+TEST_F(TypeDatabase, ConformanceFollowsSubclassesAliasesAndTheImplicitRules)
 {
+    const std::string longest = "a/" + std::string(TypeConformance::kMaxTypeLength - 2, 'b');
     expectCases(database(),
         {
-            { "image/x-child", "image/x-parent", true },
+            // transitively, and only upwards
             { "image/x-child", "image/x-grandparent", true },
             { "image/x-grandparent", "image/x-child", false },
-            { "image/x-parent", "image/x-child", false },
             { "image/x-multi", "audio/x-other", true },
-            { "image/x-multi", "image/x-grandparent", true },
             { "image/x-child", "audio/x-other", false },
             { "image/x-unknown", "image/x-unknown", true },
-            { "image/x-unknown", "image/x-parent", false },
-        });
-}
-
-TEST_F(TypeDatabase, CyclesEndAndStillConform)
-{
-    expectCases(database(),
-        {
+            // a cycle ends, and its members conform to each other
             { "cycle/one", "cycle/three", true },
-            { "cycle/three", "cycle/two", true },
             { "cycle/two", "cycle/one", true },
             { "cycle/one", "cycle/four", false },
-        });
-}
-
-TEST_F(TypeDatabase, TypesCompareWithoutRegardToCase)
-{
-    expectCases(database(),
-        {
-            { "IMAGE/X-CHILD", "image/x-grandparent", true },
-            { "image/x-child", "Image/X-GrandParent", true },
+            // case does not matter, in the query or the files
+            { "IMAGE/X-CHILD", "Image/X-GrandParent", true },
             { "upper/case", "upper/parent", true },
-            { "TEXT/HTML", "text/plain", true },
-            { "Text/Plain", "TEXT/PLAIN", true },
-        });
-    EXPECT_EQ(database().canonical("Upper/Case"), "upper/case");
-}
-
-TEST_F(TypeDatabase, AliasesStandForTheirCanonicalTypeOnEitherSide)
-{
-    expectCases(database(),
-        {
+            // an alias is its canonical type on either side, whichever directory declares what
             { "old/name", "new/name", true },
             { "new/name", "old/name", true },
-            { "old/name", "base/type", true }, // the subclass is declared, in another directory, on the canonical name
-            { "application/x-kid", "base/type", true }, // declared on the alias
+            { "old/name", "base/type", true },
+            { "application/x-kid", "base/type", true },
             { "base/type", "old/name", false },
+            { "shadowed/alias", "high/target", true },
+            { "shadowed/alias", "low/target", false },
+            // text/* to text/plain, also through a parent; everything to application/octet-stream
+            { "TEXT/HTML", "text/plain", true },
+            { "application/x-script", "text/plain", true },
+            { "image/x-child", "text/plain", false },
+            { "text/plain", "text/x-anything", false },
+            { "x-never/declared", "application/octet-stream", true },
+            { "application/octet-stream", "image/x-child", false },
+            // strings that are no type conform to nothing
+            { longest, "application/octet-stream", true },
+            { longest + "b", "application/octet-stream", false },
+            { longest + "b", longest + "b", false },
+            { "", "application/octet-stream", false },
+            { "noslash", "noslash", false },
+            { "a/b/c", "application/octet-stream", false },
+            { "a/", "application/octet-stream", false },
+            { "text/with space", "text/plain", false },
+            { "text/caf\xc3\xa9", "text/plain", false },
+            { "text/plain", "text/", false },
         });
     EXPECT_EQ(database().canonical("OLD/Name"), "new/name");
 }
 
-TEST_F(TypeDatabase, TheFirstDirectoryDecidesAnAlias)
-{
-    EXPECT_EQ(database().canonical("shadowed/alias"), "high/target");
-    expectCases(database(), { { "shadowed/alias", "high/target", true }, { "shadowed/alias", "low/target", false } });
-}
-
-TEST_F(TypeDatabase, ImplicitRulesForTextAndOctetStream)
-{
-    expectCases(database(),
-        {
-            { "text/x-anything", "text/plain", true },
-            { "application/x-script", "text/plain", true }, // through its text/* parent
-            { "image/x-child", "text/plain", false },
-            { "text/plain", "text/x-anything", false },
-            { "image/x-child", "application/octet-stream", true },
-            { "x-never/declared", "application/octet-stream", true },
-            { "application/octet-stream", "image/x-child", false },
-        });
-}
-
-TEST_F(TypeDatabase, StringsThatAreNoTypeConformToNothing)
-{
-    const std::string longest = "a/" + std::string(TypeConformance::kMaxTypeLength - 2, 'b');
-    const std::string tooLong = longest + "b";
-    expectCases(database(),
-        {
-            { longest.c_str(), "application/octet-stream", true },
-            { longest.c_str(), longest.c_str(), true },
-            { tooLong.c_str(), "application/octet-stream", false },
-            { tooLong.c_str(), tooLong.c_str(), false },
-            { "", "application/octet-stream", false },
-            { "noslash", "noslash", false },
-            { "a/b/c", "application/octet-stream", false },
-            { "/b", "application/octet-stream", false },
-            { "a/", "application/octet-stream", false },
-            { "text/with space", "text/plain", false },
-            { "text/tab\there", "text/plain", false },
-            { "text/caf\xc3\xa9", "text/plain", false },
-            { "text/plain", "", false },
-            { "text/plain", "text/", false },
-        });
-}
-
 TEST_F(TypeDatabase, JunkLinesAreSkippedOneByOne)
 {
-    std::string junk = "# comment line\n"
-                       "\n"
-                       "just-one-word\n"
-                       "three/words here/too and/more\n"
-                       "crlf/child crlf/parent\r\n"
-                       "double/space  double/parent\n";
+    std::string junk = "# comment\n\njust-one-word\nthree/words here/too and/more\n"
+                       "crlf/child crlf/parent\r\ndouble/space  double/parent\n";
     const char binary[] = "bin\0ary/x \xff\xfe/x\n";
     junk.append(binary, sizeof binary - 1);
     junk += "huge/" + std::string(100000, 'x') + " huge/parent\n";
-    junk += "good/child good/parent\n";
-    junk += "last/child last/parent"; // no final newline
+    junk += "good/child good/parent\nlast/child last/parent"; // no final newline
     writeMime("high", "subclasses", junk);
 
     expectCases(database(),
@@ -184,22 +128,17 @@ TEST_F(TypeDatabase, JunkLinesAreSkippedOneByOne)
         });
 }
 
-TEST_F(TypeDatabase, AFileLargerThanTheLimitIsIgnoredWhole)
+TEST_F(TypeDatabase, OversizedFilesAndFifosContributeNothing)
 {
     for (const off_t size : { off_t(TypeConformance::kMaxFileSize), off_t(TypeConformance::kMaxFileSize + 1) }) {
         writeMime("high", "subclasses", "big/child big/parent\n");
         ASSERT_EQ(::truncate((m_fixture.root() + "/high/mime/subclasses").c_str(), size), 0); // sparse
-        EXPECT_EQ(database().conforms("big/child", "big/parent"), size <= off_t(TypeConformance::kMaxFileSize)) << size;
+        EXPECT_EQ(database().conforms("big/child", "big/parent"), size <= off_t(TypeConformance::kMaxFileSize));
     }
-}
-
-TEST_F(TypeDatabase, MissingFilesAndAFifoInTheirPlaceLeaveAnEmptyDatabase)
-{
-    m_fixture.makeDirectory("fifo/mime");
-    ASSERT_EQ(::mkfifo((m_fixture.root() + "/fifo/mime/subclasses").c_str(), 0600), 0);
-    const auto empty = TypeConformance::fromDirectories({ m_fixture.root() + "/fifo", m_fixture.root() + "/none" });
-    EXPECT_FALSE(empty.conforms("image/x-child", "image/x-parent"));
-    EXPECT_TRUE(empty.conforms("text/html", "text/plain"));
+    ASSERT_EQ(::unlink((m_fixture.root() + "/high/mime/subclasses").c_str()), 0);
+    ASSERT_EQ(::mkfifo((m_fixture.root() + "/high/mime/subclasses").c_str(), 0600), 0); // no writer: would block
+    EXPECT_FALSE(database().conforms("image/x-child", "image/x-parent"));
+    EXPECT_TRUE(database().conforms("old/name", "base/type"));
 }
 
 // Facts of the installed shared-mime-info database, as this machine's files state them.
@@ -208,13 +147,11 @@ TEST(InstalledTypeDatabase, FollowsTheSystemFiles)
     struct stat info;
     if (::stat("/usr/share/mime/subclasses", &info) != 0)
         GTEST_SKIP() << "no shared-mime-info database";
-    const auto system = TypeConformance::fromDirectories({ "/usr/share" });
-    expectCases(system,
+    expectCases(TypeConformance::fromDirectories({ "/usr/share" }),
         {
             { "application/x-shellscript", "text/plain", true },
             { "application/x-shellscript", "application/x-executable", true },
             { "application/x-csh", "text/plain", true }, // through application/x-shellscript
-            { "application/xml", "text/plain", true },
             { "image/svg+xml", "text/plain", true }, // through application/xml
             { "text/xml", "application/xml", true }, // an alias
             { "image/png", "text/plain", false },
@@ -222,19 +159,15 @@ TEST(InstalledTypeDatabase, FollowsTheSystemFiles)
         });
 }
 
-// The machine's database is built once, whichever thread asks first.
 TEST(InstalledTypeDatabase, SharedIsOneDatabaseForEveryThread)
 {
     std::vector<const TypeConformance*> seen(8);
     std::vector<std::thread> threads;
-    for (size_t i = 0; i < seen.size(); ++i) {
-        threads.emplace_back([&seen, i] {
-            seen[i] = &TypeConformance::shared();
-            EXPECT_TRUE(seen[i]->conforms("text/x-csrc", "text/plain"));
-        });
-    }
+    for (size_t i = 0; i < seen.size(); ++i)
+        threads.emplace_back([&seen, i] { seen[i] = &TypeConformance::shared(); });
     for (auto& thread : threads)
         thread.join();
     for (const auto* database : seen)
         EXPECT_EQ(database, seen[0]);
+    EXPECT_TRUE(seen[0]->conforms("text/x-csrc", "text/plain"));
 }
