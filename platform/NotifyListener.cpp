@@ -133,8 +133,9 @@ void NotifyListener::run()
         const int processed = sd_bus_process(bus, nullptr);
         if (processed > 0)
             continue;
-        int events = processed < 0 ? processed : sd_bus_get_events(bus);
+        const int events = processed < 0 ? processed : sd_bus_get_events(bus);
         if (events < 0) {
+            // The bus went away (or never let us in); nothing will arrive on this connection again.
             log().error("notification listener lost the message bus: %s",
                 OMError::fromErrno("sd_bus_process", -events).localizedDescription());
             return;
