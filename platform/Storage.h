@@ -49,7 +49,7 @@ public:
         const std::string& path, std::span<const uint8_t> bytes, unsigned mode = 0644);
     // Reads a whole regular file of at most maxBytes, however it grows while being read; a FIFO or
     // device put in its place fails at once instead of blocking. status, when given, receives the
-    // fstat() of the file that was read.
+    // fstat() of what was opened, also when it then fails for being no regular file or too large.
     static Result<std::vector<uint8_t>> readFile(
         const std::string& path, size_t maxBytes, struct stat* status = nullptr);
 };
