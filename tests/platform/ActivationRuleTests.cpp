@@ -205,11 +205,3 @@ TEST_F(ActivationRuleTest, TheLargestDenseProblemIsDecided)
     entries.back() = { "image/png", 1 };
     EXPECT_FALSE(evaluate(Value::dictionary(entries), items(types)));
 }
-
-TEST(ActivationRule, UsesTheMachineDatabaseByDefault)
-{
-    const Value rule = Value::dictionary({ { "text/plain", 2 } });
-    const Value twoTexts = Value::dictionary({ { "types", Value::array({ "text/html", "text/x-csrc" }) } });
-    EXPECT_TRUE(ActivationRule::evaluate(rule, twoTexts));
-    EXPECT_FALSE(ActivationRule::evaluate(rule, Value::dictionary({ { "types", Value::array({ "image/png" }) } })));
-}
