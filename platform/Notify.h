@@ -7,10 +7,11 @@
 //
 // post() never blocks its caller: it hands the name to one poster queue that owns the connection
 // (opened on first use, and again after a failure), emits the signal and flushes. Posts leave in
-// the order they were made. Without a reachable bus a post is logged at debug level and dropped;
-// nothing is retried. The queue is bounded: when kMaxPending names wait (a bus that stopped
-// reading), a name already waiting is not queued again, since its one signal still tells
-// listeners what changed, and any other name is dropped with an error log line.
+// the order they were made. A kept connection whose bus has gone since is replaced once for the
+// post that finds it dead; otherwise, without a reachable bus, a post is logged at debug level
+// and dropped, and nothing is retried. The queue is bounded: when kMaxPending names wait (a bus
+// that stopped reading), a name already waiting is not queued again, since its one signal still
+// tells listeners what changed, and any other name is dropped with an error log line.
 #pragma once
 
 #include <cstddef>

@@ -3,7 +3,8 @@
 // Each listener has its own bus connection and a thread that reads it; the bus filters by name
 // (a match rule on arg0), and every notification received is handed to the handler on the given
 // queue, in the order the bus delivered them. Notifications posted after create() returns are
-// received: the match rules are in place on the bus by then.
+// received: the match rules are in place on the bus by then. When the bus goes away the listener
+// logs it once at error level and receives nothing more; a new listener is needed.
 #pragma once
 
 #include <atomic>
