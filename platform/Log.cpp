@@ -12,6 +12,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <ctime>
+#include <map>
 
 namespace om {
 
@@ -203,6 +204,20 @@ Result<std::shared_ptr<Log>> Log::create(std::string subsystem, std::string cate
         return OMError::platform(
             kPlatformErrorMalformed, "log subsystem and category must not hold control characters");
     return std::shared_ptr<Log>(new Log(std::move(subsystem), std::move(category)));
+}
+
+const Log& Log::platform(std::string_view category)
+{
+    // Leaked on purpose, like the default handle: threads may log while the process exits.
+    static std::mutex mutex;
+    static auto* handles = new std::map<std::string, std::shared_ptr<Log>, std::less<>>;
+    std::lock_guard lock(mutex);
+    if (auto known = handles->find(category); known != handles->end())
+        return *known->second;
+    auto created = create("com.orvex.platform", std::string(category));
+    if (!created.ok())
+        return defaultLog();
+    return *handles->emplace(std::string(category), std::move(created).releaseValue()).first->second;
 }
 
 Log& Log::defaultLog()

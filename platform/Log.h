@@ -28,6 +28,9 @@ public:
     static Result<std::shared_ptr<Log>> create(std::string subsystem, std::string category);
     // The platform's default handle (subsystem and category empty).
     static Log& defaultLog();
+    // The handle of category in the platform layer's own subsystem, "com.orvex.platform", made on
+    // first use and kept for the life of the process; the default handle for an invalid category.
+    static const Log& platform(std::string_view category);
 
     const std::string& subsystem() const { return m_subsystem; }
     const std::string& category() const { return m_category; }

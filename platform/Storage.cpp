@@ -5,9 +5,9 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdlib>
-#include <vector>
 
 #include "platform/UniqueFd.h"
 #include "platform/Uuid.h"
@@ -120,7 +120,8 @@ Result<void> Storage::writeFileAtomically(
     const std::string& path, std::span<const uint8_t> bytes, unsigned mode, Existing existing)
 {
     const std::string directory = directoryOf(path);
-    const std::string temporary = path + ".tmp-" + Uuid::random().string();
+    // Named apart from the file, so that a file name of the full 255 bytes still has room for it.
+    const std::string temporary = directory + "/.tmp-" + Uuid::random().string();
     UniqueFd file(::open(temporary.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, mode));
     if (!file.valid())
         return OMError::fromErrno("open " + temporary, errno);
@@ -149,6 +150,49 @@ Result<void> Storage::writeFileAtomically(
     if (::fsync(parent.get()) < 0)
         return OMError::fromErrno("fsync " + directory, errno);
     return {};
+}
+
+Result<std::vector<uint8_t>> Storage::readFile(const std::string& path, size_t maxBytes, struct stat* status)
+{
+    // O_NONBLOCK so that a FIFO in the way cannot stall the open; regular files ignore it.
+    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
+    if (!fd.valid())
+        return OMError::fromErrno("open " + path, errno);
+    struct stat info { };
+    if (::fstat(fd.get(), &info) != 0)
+        return OMError::fromErrno("fstat " + path, errno);
+    if (status)
+        *status = info;
+    auto tooLarge = [&] {
+        return OMError::platform(kPlatformErrorLimit, path + ": larger than " + std::to_string(maxBytes) + " bytes");
+    };
+    if (!S_ISREG(info.st_mode))
+        return OMError::platform(kPlatformErrorUnsupported, path + ": not a regular file");
+    if (static_cast<uint64_t>(info.st_size) > maxBytes)
+        return tooLarge();
+
+    // Read to the end rather than to st_size: the file may change under us, and the limit holds
+    // whatever it grows to.
+    std::vector<uint8_t> bytes(std::min(static_cast<size_t>(info.st_size), maxBytes) + 1);
+    size_t filled = 0;
+    for (;;) {
+        if (filled == bytes.size()) {
+            if (bytes.size() > maxBytes)
+                return tooLarge();
+            bytes.resize(std::min(bytes.size() * 2, maxBytes + 1));
+        }
+        const ssize_t n = ::read(fd.get(), bytes.data() + filled, bytes.size() - filled);
+        if (n < 0) {
+            if (errno == EINTR)
+                continue;
+            return OMError::fromErrno("read " + path, errno);
+        }
+        if (n == 0)
+            break;
+        filled += static_cast<size_t>(n);
+    }
+    bytes.resize(filled);
+    return bytes;
 }
 
 } // namespace om

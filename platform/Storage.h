@@ -6,10 +6,14 @@
 // temporary directory.
 #pragma once
 
+#include <sys/stat.h>
+
+#include <cstdint>
 #include <optional>
 #include <span>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "platform/Result.h"
 
@@ -46,6 +50,11 @@ public:
     // racing to make one file, exactly one succeeds and nobody ever sees a partial one.
     static Result<void> writeFileAtomically(const std::string& path, std::span<const uint8_t> bytes,
         unsigned mode = 0644, Existing existing = Existing::Replace);
+    // Reads a whole regular file of at most maxBytes, however it grows while being read; a FIFO or
+    // device put in its place fails at once instead of blocking. status, when given, receives the
+    // fstat() of what was opened, also when it then fails for being no regular file or too large.
+    static Result<std::vector<uint8_t>> readFile(
+        const std::string& path, size_t maxBytes, struct stat* status = nullptr);
 };
 
 } // namespace om

@@ -1,14 +1,9 @@
 #include "platform/Vlist.h"
 
-#include <fcntl.h>
-#include <sys/stat.h>
-#include <unistd.h>
-
-#include <cerrno>
 #include <cstring>
 
 #include "platform/Cbor.h"
-#include "platform/UniqueFd.h"
+#include "platform/Storage.h"
 #include "platform/VlistXmlReader.h"
 #include "platform/VlistXmlWriter.h"
 
@@ -37,44 +32,6 @@ OMError withContext(const OMError& error, std::string_view context)
     return OMError(error.domain(), error.code(), std::string(context) + ": " + error.localizedDescription());
 }
 
-Result<std::vector<uint8_t>> readWholeFile(const std::filesystem::path& path)
-{
-    // O_NONBLOCK so that a FIFO in the way cannot stall the open; regular files ignore it.
-    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOCTTY | O_NONBLOCK));
-    if (!fd.valid())
-        return OMError::fromErrno("open " + path.string(), errno);
-    struct stat status { };
-    if (::fstat(fd.get(), &status) != 0)
-        return OMError::fromErrno("fstat " + path.string(), errno);
-    if (!S_ISREG(status.st_mode))
-        return OMError::platform(kPlatformErrorUnsupported, path.string() + ": not a regular file");
-    if (static_cast<uint64_t>(status.st_size) > kMaxBytes)
-        return withContext(tooLarge(static_cast<size_t>(status.st_size)), path.string());
-
-    // Read to the end rather than to st_size: the file may change under us, and the limit holds
-    // whatever it grows to.
-    std::vector<uint8_t> bytes(static_cast<size_t>(status.st_size) + 1);
-    size_t filled = 0;
-    for (;;) {
-        if (filled == bytes.size()) {
-            if (bytes.size() > kMaxBytes)
-                return withContext(tooLarge(bytes.size()), path.string());
-            bytes.resize(std::min(bytes.size() * 2, kMaxBytes + 1));
-        }
-        const ssize_t n = ::read(fd.get(), bytes.data() + filled, bytes.size() - filled);
-        if (n < 0) {
-            if (errno == EINTR)
-                continue;
-            return OMError::fromErrno("read " + path.string(), errno);
-        }
-        if (n == 0)
-            break;
-        filled += static_cast<size_t>(n);
-    }
-    bytes.resize(filled);
-    return bytes;
-}
-
 } // namespace
 
 Result<Value> Vlist::parse(std::span<const uint8_t> bytes)
@@ -99,7 +56,7 @@ Result<Value> Vlist::parse(std::string_view text)
 
 Result<Value> Vlist::readFile(const std::filesystem::path& path)
 {
-    auto bytes = OM_TRY(readWholeFile(path));
+    auto bytes = OM_TRY(Storage::readFile(path.string(), kMaxBytes));
     auto value = parse(bytes);
     if (!value.ok())
         return withContext(value.error(), path.string());

@@ -7,6 +7,7 @@
 #include <cstdlib>
 #include <regex>
 #include <thread>
+#include <vector>
 
 #include "platform/Fatal.h"
 #include "platform/Log.h"
@@ -125,6 +126,23 @@ TEST(Log, DefaultLogIsOneHandleWithoutNames)
     EXPECT_EQ(&Log::defaultLog(), &Log::defaultLog());
     EXPECT_EQ(Log::defaultLog().subsystem(), "");
     EXPECT_EQ(Log::defaultLog().category(), "");
+}
+
+TEST(Log, PlatformHandlesAreOnePerCategoryForEveryThread)
+{
+    std::vector<const Log*> seen(4);
+    std::vector<std::thread> threads;
+    for (size_t i = 0; i < seen.size(); ++i)
+        threads.emplace_back([&seen, i] { seen[i] = &Log::platform("shared-category"); });
+    for (auto& thread : threads)
+        thread.join();
+    for (const Log* log : seen)
+        EXPECT_EQ(log, seen[0]);
+    EXPECT_EQ(seen[0]->subsystem(), "com.orvex.platform");
+    EXPECT_EQ(seen[0]->category(), "shared-category");
+    EXPECT_NE(&Log::platform("other-category"), seen[0]);
+    EXPECT_EQ(&Log::platform("bad\ncategory"), &Log::defaultLog());
+    EXPECT_EQ(&Log::platform(""), &Log::defaultLog());
 }
 
 TEST(Log, CaptureSeesEveryLevelWhateverTheThreshold)

@@ -103,3 +103,35 @@ TEST(Storage, KeepingWriteNeverReplacesAndLeavesNothingBehind)
         ++entries;
     EXPECT_EQ(entries, 1u);
 }
+
+TEST(Storage, AtomicWriteTakesTheLongestFileName)
+{
+    om::test::BundleFixture fixture;
+    for (const size_t length : { size_t(255), size_t(256) }) {
+        const std::string path = fixture.root() + "/" + std::string(length, 'n');
+        EXPECT_EQ(Storage::writeFileAtomically(path, bytesOf("contents")).ok(), length <= 255) << length;
+    }
+    EXPECT_EQ(contentsOf(fixture.root() + "/" + std::string(255, 'n')), "contents");
+}
+
+// The limit holds in pairs, and what is no regular file fails at once: a FIFO with no writer
+// would otherwise block the reader for good.
+TEST(Storage, ReadFileTakesRegularFilesUpToTheLimitOnly)
+{
+    om::test::BundleFixture fixture;
+    const std::string path = fixture.writeFile("file", "0123456789");
+    auto whole = Storage::readFile(path, 10);
+    ASSERT_TRUE(whole.ok());
+    EXPECT_EQ(std::string(whole->begin(), whole->end()), "0123456789");
+    auto over = Storage::readFile(path, 9);
+    ASSERT_FALSE(over.ok());
+    EXPECT_EQ(over.error().code(), om::kPlatformErrorLimit);
+
+    const std::string fifo = fixture.root() + "/fifo";
+    ASSERT_EQ(::mkfifo(fifo.c_str(), 0600), 0);
+    for (const std::string& other : { fifo, fixture.root(), std::string("/dev/zero") }) {
+        auto read = Storage::readFile(other, 1 << 20);
+        ASSERT_FALSE(read.ok()) << other;
+        EXPECT_EQ(read.error().code(), om::kPlatformErrorUnsupported) << other;
+    }
+}
