@@ -2,6 +2,7 @@
 
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
 
@@ -154,6 +155,7 @@ Result<void> RegistrarStore::verify(RegistrarWorkspace::Access access)
             || sqlite3_step(check.statement) != SQLITE_ROW)
             return failure("quick_check");
         std::string verdict = columnText(check.statement, 0);
+        std::replace(verdict.begin(), verdict.end(), '\n', ' '); // one log line
         if (verdict != "ok") {
             return OMError(kRegistrarErrorDomain, kRegistrarErrorDatabase,
                 "registrar database " + m_path + ": damaged (quick_check: " + verdict + ")");

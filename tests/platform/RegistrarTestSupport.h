@@ -28,21 +28,21 @@ struct HeardEvent {
 
 class RecordingObserver : public RegistrarObserver {
 public:
-    // Runs inside pluginsWillUninstall, before the event is recorded.
+    // Run inside the notification, after it is recorded.
     std::function<void(const RegistrarPlugInRecords&)> onUninstall;
     std::function<void(const RegistrarPlugInRecords&)> onInstall;
 
     void pluginsDidInstall(const RegistrarPlugInRecords& records) override
     {
+        record('+', records);
         if (onInstall)
             onInstall(records);
-        record('+', records);
     }
     void pluginsWillUninstall(const RegistrarPlugInRecords& records) override
     {
+        record('-', records);
         if (onUninstall)
             onUninstall(records);
-        record('-', records);
     }
 
     std::vector<HeardEvent> events() const
