@@ -69,10 +69,13 @@ std::optional<Value> declaredPlugInDictionary(const Value& info, bool currentSty
     return old.isDictionary() ? old : Value::dictionary({});
 }
 
-// Attributes always present, and always with a version, so that every reader sees one shape.
-Value canonicalPlugInDictionary(const Value& plugIn, const Value& info)
+// Attributes always present, and always with a version, so that every reader sees one shape. None
+// when plugIn already has that shape, so that it is shared rather than copied.
+std::optional<Value> canonicalPlugInDictionary(const Value& plugIn, const Value& info)
 {
     const Value& declared = plugIn["QSExtensionAttributes"];
+    if (declared.isDictionary() && declared.contains("QSExtensionVersion"))
+        return std::nullopt;
     DictionaryBuilder attributes(declared.isDictionary() ? declared : Value::dictionary({}));
     if (attributes.get("QSExtensionVersion").isNone()) {
         const Value& shortVersion = info["VBBundleShortVersionString"];
@@ -136,14 +139,18 @@ Result<RegistrarBundleReader::PlugInFacts> RegistrarBundleReader::plugInFacts(
         if (Value entry = sdk(*extensionPoint); entry.isDictionary())
             merged = DictionaryMerge::mergeDictionary(entry, info);
     }
-    Value plugIn = canonicalPlugInDictionary(*declaredPlugInDictionary(merged, currentStyle), merged);
+    Value plugIn = *declaredPlugInDictionary(merged, currentStyle);
+    auto canonical = canonicalPlugInDictionary(plugIn, merged);
 
     PlugInFacts facts;
     facts.identifier = *identifier;
     facts.originalIdentifier = bundleIdentifier ? *bundleIdentifier : *identifier;
     facts.bundleIdentifier = optionalString(info["VBBundleIdentifier"]);
     facts.bundleVersion = optionalString(info["VBBundleVersion"]);
-    facts.infoDictionary = currentStyle ? DictionaryBuilder(merged).set("QSExtension", plugIn).build() : merged;
+    if (canonical)
+        plugIn = std::move(*canonical);
+    facts.infoDictionary
+        = currentStyle && canonical ? DictionaryBuilder(merged).set("QSExtension", plugIn).build() : merged;
     facts.isDataPlugIn = plugIn["QSExtensionProtocol"] == Value(kDataProtocol);
     facts.plugInDictionary = std::move(plugIn);
     facts.entitlements = entitlements;

@@ -36,6 +36,7 @@ constexpr const char* kSelectAll
 constexpr const char* kInsert = "INSERT INTO registrations (sequence, uuid, path, identifier, info, entitlements, "
                                 "registered, container, application) VALUES (?, ?, ?, ?, ?, ?, ?, ?, ?)";
 constexpr const char* kDelete = "DELETE FROM registrations WHERE uuid = ?";
+constexpr const char* kSelectInfo = "SELECT info FROM registrations WHERE uuid = ?";
 
 // Another process (omctl reading, a second daemon by mistake) may hold the file for a moment.
 constexpr int kBusyTimeoutMs = 10'000;
@@ -86,6 +87,7 @@ RegistrarStore::~RegistrarStore()
 {
     sqlite3_finalize(m_insert);
     sqlite3_finalize(m_delete);
+    sqlite3_finalize(m_selectInfo);
     sqlite3_close_v2(m_database);
 }
 
@@ -268,6 +270,19 @@ Result<std::vector<RegistrarStore::Row>> RegistrarStore::load()
     if (status != SQLITE_DONE)
         return failure("reading registrations");
     return rows;
+}
+
+Value RegistrarStore::declaredInfo(const Uuid& uuid)
+{
+    auto select = statement(m_selectInfo, kSelectInfo);
+    if (!select.ok())
+        return {};
+    sqlite3_bind_blob(*select, 1, uuid.bytes().data(), int(uuid.bytes().size()), SQLITE_STATIC);
+    if (sqlite3_step(*select) != SQLITE_ROW)
+        return {};
+    auto info = Vlist::parse(columnBlob(*select, 0));
+    sqlite3_reset(*select);
+    return info.ok() ? std::move(info).releaseValue() : Value();
 }
 
 Result<void> RegistrarStore::apply(std::span<const Uuid> removed, std::span<const Row> inserted)

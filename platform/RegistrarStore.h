@@ -53,6 +53,10 @@ public:
     // Every registration, in registration order. A row that no longer decodes is logged and left
     // out (and left in the file).
     Result<std::vector<Row>> load();
+    // What the bundle registered under uuid declared, read back from the file (kept there rather
+    // than in memory: only a refresh asks); none when there is no such registration or it does not
+    // decode.
+    Value declaredInfo(const Uuid& uuid);
     // One transaction: the registrations with the removed UUIDs go, the inserted rows come.
     Result<void> apply(std::span<const Uuid> removed, std::span<const Row> inserted);
 
@@ -72,6 +76,7 @@ private:
     const Log& m_log;
     sqlite3_stmt* m_insert = nullptr;
     sqlite3_stmt* m_delete = nullptr;
+    sqlite3_stmt* m_selectInfo = nullptr;
 };
 
 } // namespace om

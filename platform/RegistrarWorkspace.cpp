@@ -125,7 +125,6 @@ Result<std::shared_ptr<RegistrarWorkspace>> RegistrarWorkspace::open(const Confi
             application = known;
         }
         auto record = state->makeRecord(row, std::move(facts).releaseValue(), std::move(application));
-        state->declaredInfo.emplace(row.uuid, std::move(row.info));
         state->index.insert(record);
     }
     return std::shared_ptr<RegistrarWorkspace>(new RegistrarWorkspace(std::move(state)));

@@ -93,9 +93,9 @@ std::optional<RegistrarWorkspace::State::Change> RegistrarWorkspace::State::plan
     std::optional<std::string> container = reading.facts.isDataPlugIn
         ? std::nullopt
         : dataContainer(configuration.containersDirectory, reading.facts.identifier, log());
-    if (sameIdentifier && declaredInfo[existing->uuid()] == reading.info
-        && existing->entitlements() == reading.facts.entitlements && existing->dataContainerPath() == container
-        && applicationPathOf(*existing) == reading.applicationPath) {
+    if (sameIdentifier && existing->entitlements() == reading.facts.entitlements
+        && existing->dataContainerPath() == container && applicationPathOf(*existing) == reading.applicationPath
+        && store->declaredInfo(existing->uuid()) == reading.info) {
         unchanged = existing; // nothing to write, nobody to tell, the first date kept
         return std::nullopt;
     }
@@ -176,10 +176,6 @@ void RegistrarWorkspace::State::commit(std::vector<Change>& changes, std::vector
         for (const auto& record : installed)
             index.insert(record);
     }
-    for (const Uuid& uuid : removed)
-        declaredInfo.erase(uuid);
-    for (const RegistrarStore::Row& row : rows)
-        declaredInfo[row.uuid] = row.info;
     notifier.announceInstall(std::move(installed));
 }
 
@@ -212,7 +208,6 @@ Result<void> RegistrarWorkspace::State::unregister(std::string_view bundlePath)
         std::unique_lock lock(indexMutex);
         index.remove(uuid);
     }
-    declaredInfo.erase(uuid);
     return {};
 }
 

@@ -66,9 +66,6 @@ struct RegistrarWorkspace::State {
     // Used only while holding the notifier's queue (and while opening).
     std::unique_ptr<RegistrarStore> store;
     uint64_t nextSequence = 1;
-    // What each registered bundle's Info.vlist said, before the SDK merge: the test of whether a
-    // refresh changes anything.
-    std::unordered_map<Uuid, Value> declaredInfo;
 
     // Held only to read or to update the index, never across disk I/O or a notification.
     mutable std::shared_mutex indexMutex;
