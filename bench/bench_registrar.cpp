@@ -19,6 +19,7 @@
 #include <fstream>
 #include <map>
 
+#include "bench/BenchRatios.h"
 #include "platform/Registrar.h"
 #include "platform/RegistrarBundleReader.h"
 #include "platform/Vlist.h"
@@ -203,26 +204,28 @@ size_t spanOf(const benchmark::State& state, size_t count)
     return state.range(1) == kWorkingSet ? std::min(count, kSmall) : count;
 }
 
+// Looks keys up with lookup, striding through those the benchmark's access reaches.
+template <typename Key, typename Lookup>
+void lookUpEach(benchmark::State& state, const std::vector<Key>& keys, const Lookup& lookup)
+{
+    const size_t span = spanOf(state, keys.size());
+    size_t index = 0;
+    for (auto _ : state) {
+        benchmark::DoNotOptimize(lookup(keys[index]));
+        index = next(index, span);
+    }
+}
+
 void lookupByUuid(benchmark::State& state)
 {
     Population& plugIns = population(size_t(state.range(0)));
-    const size_t span = spanOf(state, plugIns.uuids().size());
-    size_t index = 0;
-    for (auto _ : state) {
-        benchmark::DoNotOptimize(plugIns.workspace().plugInWithUuid(plugIns.uuids()[index]));
-        index = next(index, span);
-    }
+    lookUpEach(state, plugIns.uuids(), [&](const Uuid& uuid) { return plugIns.workspace().plugInWithUuid(uuid); });
 }
 
 void lookupByPath(benchmark::State& state)
 {
     Population& plugIns = population(size_t(state.range(0)));
-    const size_t span = spanOf(state, plugIns.paths().size());
-    size_t index = 0;
-    for (auto _ : state) {
-        benchmark::DoNotOptimize(plugIns.workspace().plugInAtPath(plugIns.paths()[index]));
-        index = next(index, span);
-    }
+    lookUpEach(state, plugIns.paths(), [&](const std::string& path) { return plugIns.workspace().plugInAtPath(path); });
 }
 
 void queryByExtensionPoint(benchmark::State& state)
@@ -250,20 +253,9 @@ BENCHMARK(queryByExtensionPoint)->ArgsProduct({ { kSmall, kLarge }, { kWorkingSe
 
 // Prints, after the table, each operation's cost at 100,000 plug-ins over its cost at 100, and the
 // memory each plug-in took.
-class RatioReporter : public benchmark::ConsoleReporter {
-public:
-    void ReportRuns(const std::vector<Run>& runs) override
-    {
-        for (const auto& run : runs) {
-            if (run.run_type == Run::RT_Iteration && run.iterations > 0)
-                m_seconds[run.run_name.str()].push_back(run.cpu_accumulated_time / double(run.iterations));
-            else if (run.run_type == Run::RT_Aggregate && run.aggregate_name == "median")
-                m_seconds[run.run_name.str()].push_back(run.GetAdjustedCPUTime() * 1e-9);
-        }
-        ConsoleReporter::ReportRuns(runs);
-    }
-
-    void Finalize() override
+class ScaleRatios : public RatioReporter {
+protected:
+    void printRatios() override
     {
         std::printf(
             "\nratios, %zu plug-ins over %zu (CPU time per operation, median of the repetitions)\n", kLarge, kSmall);
@@ -287,21 +279,7 @@ public:
                 g_footprint.reopenedPerPlugIn - g_footprint.dictionariesPerPlugIn);
             std::printf("  %-40s %8.0f bytes\n", "its Info.vlist (XML, for scale)", g_footprint.declaredPerPlugIn);
         }
-        ConsoleReporter::Finalize();
     }
-
-private:
-    double median(const std::string& name)
-    {
-        auto it = m_seconds.find(name);
-        if (it == m_seconds.end())
-            return 0;
-        auto& samples = it->second;
-        std::sort(samples.begin(), samples.end());
-        return samples[samples.size() / 2];
-    }
-
-    std::map<std::string, std::vector<double>> m_seconds;
 };
 
 } // namespace
@@ -309,11 +287,5 @@ private:
 
 int main(int argc, char** argv)
 {
-    benchmark::Initialize(&argc, argv);
-    if (benchmark::ReportUnrecognizedArguments(argc, argv))
-        return 1;
-    om::bench::RatioReporter reporter;
-    benchmark::RunSpecifiedBenchmarks(&reporter);
-    benchmark::Shutdown();
-    return 0;
+    return om::bench::runWithRatios<om::bench::ScaleRatios>(argc, argv);
 }

@@ -7,8 +7,7 @@
 
 #include "platform/Log.h"
 #include "tests/platform/RegistrarTestSupport.h"
-
-extern char** environ;
+#include "tests/support/ChildProcess.h"
 
 using om::DictionaryBuilder;
 using om::Value;
@@ -19,23 +18,6 @@ namespace fs = std::filesystem;
 
 const std::string kEntitle = std::string(OM_SOURCE_DIR) + "/scripts/entitle";
 const std::string kPeer = std::string(OM_BINARY_DIR) + "/tests/om_test_peer";
-
-int run(const std::vector<std::string>& arguments)
-{
-    std::vector<char*> argv;
-    for (const auto& argument : arguments)
-        argv.push_back(const_cast<char*>(argument.c_str()));
-    argv.push_back(nullptr);
-    pid_t pid;
-    if (::posix_spawn(&pid, argv[0], nullptr, nullptr, argv.data(), environ) != 0)
-        return -1;
-    int status = 0;
-    while (::waitpid(pid, &status, 0) < 0) {
-        if (errno != EINTR)
-            return -1;
-    }
-    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-}
 
 class RegistrarRefresh : public om::test::RegistrarTest { };
 
@@ -140,7 +122,7 @@ protected:
         fs::remove(path + "/tool");
         fs::copy_file(kPeer, path + "/tool");
         ::chmod((path + "/tool").c_str(), 0755);
-        EXPECT_EQ(run({ kEntitle, path + "/tool",
+        EXPECT_EQ(om::test::ChildProcess::run({ kEntitle, path + "/tool",
                       m_bundles.writeFile(name + ".entitlements", om::Vlist::writeXml(entitlements)) }),
             0);
         return path;
@@ -186,7 +168,7 @@ TEST_F(RegistrarEntitlements, MissingOrDamagedExecutableGrantsNothingAndIsLogged
         "missing.appex", DictionaryBuilder(plugIn("com.orvex.missing", "p")).set("VBBundleExecutable", "tool").build());
     fs::remove(missing + "/tool");
     std::string damaged = entitledPlugIn("damaged", Value::dictionary({ { "e", true } }));
-    ASSERT_EQ(run({ kEntitle, damaged + "/tool",
+    ASSERT_EQ(om::test::ChildProcess::run({ kEntitle, damaged + "/tool",
                   m_bundles.writeFile("bad.vlist", "<vlist version=\"1\"><dict><key>a</key></dict></vlist>") }),
         0);
 
@@ -209,7 +191,7 @@ TEST_F(RegistrarEntitlements, ChangedEntitlementsAreAChange)
     workspace()->waitForNotifications();
     auto observer = observe();
     ASSERT_EQ(
-        run({ kEntitle, path + "/tool",
+        om::test::ChildProcess::run({ kEntitle, path + "/tool",
             m_bundles.writeFile("second.vlist", om::Vlist::writeXml(Value::dictionary({ { "second", true } }))) }),
         0);
     auto second = registered(path);
