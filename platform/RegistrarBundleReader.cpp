@@ -209,8 +209,8 @@ Result<Value> RegistrarBundleReader::readInfo(const std::string& bundlePath)
     if (status.st_size > off_t(kMaxInfoBytes))
         return unreadableInfo(bundlePath, "larger than " + std::to_string(kMaxInfoBytes) + " bytes");
 
-    // One byte past the bound tells a file that grew since fstat from one that fits.
-    std::vector<uint8_t> bytes(kMaxInfoBytes + 1);
+    // One byte past the size tells a file that grew since fstat from one that did not.
+    std::vector<uint8_t> bytes(size_t(status.st_size) + 1);
     size_t done = 0;
     while (done < bytes.size()) {
         ssize_t n = ::read(file.get(), bytes.data() + done, bytes.size() - done);
@@ -222,6 +222,8 @@ Result<Value> RegistrarBundleReader::readInfo(const std::string& bundlePath)
             break;
         done += size_t(n);
     }
+    if (done > size_t(status.st_size))
+        return unreadableInfo(bundlePath, "it changed while it was read");
     bytes.resize(done);
     auto info = parseInfo(bytes);
     if (!info.ok())

@@ -36,6 +36,7 @@ constexpr const char* kSelectAll
 constexpr const char* kInsert = "INSERT INTO registrations (sequence, uuid, path, identifier, info, entitlements, "
                                 "registered, container, application) VALUES (?, ?, ?, ?, ?, ?, ?, ?, ?)";
 constexpr const char* kDelete = "DELETE FROM registrations WHERE uuid = ?";
+constexpr const char* kDeletePath = "DELETE FROM registrations WHERE path = ?";
 constexpr const char* kSelectInfo = "SELECT info FROM registrations WHERE uuid = ?";
 
 // Another process (omctl reading, a second daemon by mistake) may hold the file for a moment.
@@ -88,6 +89,7 @@ RegistrarStore::~RegistrarStore()
     sqlite3_finalize(m_insert);
     sqlite3_finalize(m_delete);
     sqlite3_finalize(m_selectInfo);
+    sqlite3_finalize(m_deletePath);
     sqlite3_close_v2(m_database);
 }
 
@@ -260,6 +262,7 @@ Result<std::vector<RegistrarStore::Row>> RegistrarStore::load()
         return failure("reading registrations");
     }
     while ((status = sqlite3_step(query.statement)) == SQLITE_ROW) {
+        m_lastSequence = std::max(m_lastSequence, uint64_t(sqlite3_column_int64(query.statement, 0)));
         if (auto row = decode(query.statement)) {
             rows.push_back(std::move(*row));
             continue;
@@ -307,6 +310,10 @@ Result<void> RegistrarStore::applyInTransaction(std::span<const Uuid> removed, s
             return failure("removing a registration");
     }
     for (const Row& row : inserted) {
+        sqlite3_stmt* stale = OM_TRY(statement(m_deletePath, kDeletePath));
+        sqlite3_bind_text(stale, 1, row.path.data(), int(row.path.size()), SQLITE_STATIC);
+        if (sqlite3_step(stale) != SQLITE_DONE)
+            return failure("removing a registration");
         sqlite3_stmt* insert = OM_TRY(statement(m_insert, kInsert));
         std::vector<uint8_t> info = Vlist::writeBinary(row.info);
         std::vector<uint8_t> entitlements

@@ -53,11 +53,14 @@ public:
     // Every registration, in registration order. A row that no longer decodes is logged and left
     // out (and left in the file).
     Result<std::vector<Row>> load();
+    // The highest sequence load() saw, rows left out included: new registrations go above it.
+    uint64_t lastSequence() const { return m_lastSequence; }
     // What the bundle registered under uuid declared, read back from the file (kept there rather
     // than in memory: only a refresh asks); none when there is no such registration or it does not
     // decode.
     Value declaredInfo(const Uuid& uuid);
-    // One transaction: the registrations with the removed UUIDs go, the inserted rows come.
+    // One transaction: the registrations with the removed UUIDs go, the inserted rows come (each
+    // replacing whatever is stored at its path, a row load() left out included).
     Result<void> apply(std::span<const Uuid> removed, std::span<const Row> inserted);
 
 private:
@@ -77,6 +80,8 @@ private:
     sqlite3_stmt* m_insert = nullptr;
     sqlite3_stmt* m_delete = nullptr;
     sqlite3_stmt* m_selectInfo = nullptr;
+    sqlite3_stmt* m_deletePath = nullptr;
+    uint64_t m_lastSequence = 0;
 };
 
 } // namespace om

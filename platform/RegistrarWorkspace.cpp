@@ -106,11 +106,11 @@ Result<std::shared_ptr<RegistrarWorkspace>> RegistrarWorkspace::open(const Confi
         return rows.error();
     }
     auto state = std::make_unique<State>(configuration, access, std::move(store));
+    state->nextSequence = state->store->lastSequence() + 1;
 
     // Plug-ins of one application share its record, read once.
     std::unordered_map<std::string, std::shared_ptr<const RegistrarAppRecord>> applications;
     for (RegistrarStore::Row& row : *rows) {
-        state->nextSequence = std::max(state->nextSequence, row.sequence + 1);
         auto facts = RegistrarBundleReader::plugInFacts(row.path, row.info, row.entitlements, state->sdkLookup());
         if (!facts.ok()) {
             State::log().error("registrar database %s: registration of %s is left out: %s", configuration.databasePath,

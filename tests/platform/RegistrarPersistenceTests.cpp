@@ -136,6 +136,29 @@ TEST_F(RegistrarPersistence, RegistrationSurvivesKillRightAfterItReturns)
     EXPECT_EQ(record->bundlePath(), path);
 }
 
+TEST_F(RegistrarPersistence, RegistrationThatNoLongerDecodesIsLeftOutUntilRegisteredAgain)
+{
+    std::string b = bundle("b.appex", plugIn("com.orvex.b", "p"));
+    registered(bundle("a.appex", plugIn("com.orvex.a", "p")));
+    registered(b);
+    registered(bundle("c.appex", plugIn("com.orvex.c", "p")));
+    m_workspace.reset();
+    runSql("UPDATE registrations SET info = x'766c73743100ff' WHERE identifier = 'com.orvex.b'");
+
+    om::Log::Capture capture;
+    EXPECT_EQ(workspace()->plugInCount(), 2u);
+    EXPECT_TRUE(capture.waitFor(
+        "registrar database " + configuration().databasePath + ": registration 2 does not decode; left out"));
+    auto again = workspace()->registerPlugIn(b);
+    ASSERT_TRUE(again.ok()) << again.error().localizedDescription();
+    EXPECT_GT(again.value()->sequence(), 3u) << "above the row that was left out";
+    m_workspace.reset();
+
+    auto reopened = open();
+    ASSERT_EQ(reopened->plugInCount(), 3u);
+    EXPECT_EQ(reopened->allPlugIns().back()->identifier(), "com.orvex.b");
+}
+
 TEST_F(RegistrarPersistence, DamagedDatabaseIsRefusedUntouched)
 {
     for (char name : { 'a', 'b', 'c', 'd', 'e', 'f' })
