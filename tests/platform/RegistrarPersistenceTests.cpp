@@ -222,3 +222,48 @@ TEST_F(RegistrarPersistence, ReadOnlyOpenSeesWhatTheWriterCommitted)
 }
 
 } // namespace
+
+namespace {
+
+TEST_F(RegistrarPersistence, DefaultWorkspaceOpensFromTheEnvironmentOnce)
+{
+    const auto wanted = configuration();
+    ::setenv("REGISTRAR_DB", wanted.databasePath.c_str(), 1);
+    ::setenv("REGISTRAR_SDK_DIR", wanted.sdkDirectory.c_str(), 1);
+    ::setenv("REGISTRAR_CONTAINERS", wanted.containersDirectory.c_str(), 1);
+    const auto fromEnvironment = RegistrarWorkspace::Configuration::fromEnvironment();
+    EXPECT_EQ(fromEnvironment.databasePath, wanted.databasePath);
+    EXPECT_EQ(fromEnvironment.sdkDirectory, wanted.sdkDirectory);
+    EXPECT_EQ(fromEnvironment.containersDirectory, wanted.containersDirectory);
+
+    RegistrarWorkspace::setDefaultWorkspace(nullptr);
+    auto first = RegistrarWorkspace::defaultWorkspace();
+    auto second = RegistrarWorkspace::defaultWorkspace();
+    ASSERT_TRUE(first.ok() && second.ok());
+    EXPECT_EQ(first.value(), second.value());
+    EXPECT_EQ(first.value()->configuration().databasePath, wanted.databasePath);
+    EXPECT_TRUE(fs::exists(wanted.databasePath));
+
+    auto own = open();
+    RegistrarWorkspace::setDefaultWorkspace(own);
+    EXPECT_EQ(RegistrarWorkspace::defaultWorkspace().value(), own);
+    RegistrarWorkspace::setDefaultWorkspace(nullptr);
+    for (const char* name : { "REGISTRAR_DB", "REGISTRAR_SDK_DIR", "REGISTRAR_CONTAINERS" })
+        ::unsetenv(name);
+
+    // Without settings: a system instance's locations for root, the user's data home otherwise.
+    const char* dataHome = std::getenv("XDG_DATA_HOME");
+    const std::string savedDataHome = dataHome ? dataHome : "";
+    ::setenv("XDG_DATA_HOME", m_bundles.root().c_str(), 1);
+    const auto defaults = RegistrarWorkspace::Configuration::fromEnvironment();
+    const bool root = ::geteuid() == 0;
+    EXPECT_EQ(defaults.databasePath, root ? "/var/lib/omd/registrar.db" : m_bundles.root() + "/omd/registrar.db");
+    EXPECT_EQ(defaults.containersDirectory, root ? "/var/lib/omd/containers" : m_bundles.root() + "/omd/containers");
+    EXPECT_EQ(defaults.sdkDirectory, "/usr/share/omd/sdk");
+    if (dataHome)
+        ::setenv("XDG_DATA_HOME", savedDataHome.c_str(), 1);
+    else
+        ::unsetenv("XDG_DATA_HOME");
+}
+
+} // namespace

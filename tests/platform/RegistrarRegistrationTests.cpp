@@ -210,6 +210,18 @@ TEST_F(RegistrarRecordFacts, CanonicalFormAlwaysHasAttributesWithAVersion)
     }
 }
 
+TEST_F(RegistrarRecordFacts, SystemPartitionIsThePathPrefixWithItsSlash)
+{
+    const Value info = plugIn("com.orvex.a", "p");
+    for (auto [path, onSystem] : { std::pair { "/System/Library/a.appex", true }, std::pair { "/System/a.appex", true },
+             std::pair { "/SystemExtras/a.appex", false }, std::pair { "/system/a.appex", false },
+             std::pair { "/opt/System/a.appex", false } }) {
+        auto facts = om::RegistrarBundleReader::plugInFacts(path, info, Value(), {});
+        ASSERT_TRUE(facts.ok());
+        EXPECT_EQ(facts->onSystemPartition, onSystem) << path;
+    }
+}
+
 TEST_F(RegistrarRecordFacts, OldStylePlugInsReadTheirOmbrelKey)
 {
     Value base = om::test::BundleFixture::appInfo("com.orvex.old", "");
