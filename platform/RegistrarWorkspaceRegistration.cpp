@@ -158,13 +158,17 @@ void RegistrarWorkspace::State::commit(std::vector<Change>& changes, std::vector
     for (Change& change : changes) {
         std::shared_ptr<const RegistrarAppRecord> application;
         if (const auto& path = change.row.applicationPath) {
-            auto& known = applications[*path];
-            if (!known) {
-                std::shared_lock lock(indexMutex);
-                known = index.application(*path);
+            // Read once per commit: the plug-ins of one application share its record.
+            auto [entry, first] = applications.try_emplace(*path);
+            if (first) {
+                std::shared_ptr<const RegistrarAppRecord> known;
+                {
+                    std::shared_lock lock(indexMutex);
+                    known = index.application(*path);
+                }
+                entry->second = readApplication(*path, known);
             }
-            known = readApplication(*path, known);
-            application = known;
+            application = entry->second;
         }
         installed.push_back(makeRecord(change.row, std::move(change.facts), std::move(application)));
         results[change.result] = installed.back();

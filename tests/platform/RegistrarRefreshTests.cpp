@@ -110,6 +110,17 @@ TEST_F(RegistrarRefresh, BatchRegistrationAnswersEachPathInOrder)
     ASSERT_EQ(observer->events().size(), 1u) << "one commit, one notification";
     EXPECT_EQ(observer->transcript(), "+com.orvex.a +com.orvex.b");
     EXPECT_LT(results[0].value()->sequence(), results[2].value()->sequence());
+
+    // Plug-ins of one application share its record, within a batch and after it.
+    std::string app = m_bundles.makeApp("Notes", "com.orvex.notes");
+    auto inApp = workspace()->registerPlugIns({ bundle("Notes.app/PlugIns/c.appex", plugIn("com.orvex.c", "p")),
+        bundle("Notes.app/PlugIns/d.appex", plugIn("com.orvex.d", "p")) });
+    ASSERT_TRUE(inApp[0].ok() && inApp[1].ok());
+    EXPECT_EQ(inApp[0].value()->containingApp(), inApp[1].value()->containingApp());
+    auto later = registered(bundle("Notes.app/PlugIns/e.appex", plugIn("com.orvex.e", "p")));
+    ASSERT_TRUE(later);
+    EXPECT_EQ(later->containingApp(), inApp[0].value()->containingApp());
+    EXPECT_EQ(workspace()->applicationAtPath(app), later->containingApp());
 }
 
 class RegistrarEntitlements : public om::test::RegistrarTest {
