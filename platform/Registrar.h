@@ -14,10 +14,13 @@
 // visible is the daemon's decision. Registering a registered path again refreshes it and keeps its
 // UUID while its identifier is unchanged.
 //
-// Observers hear of installs and uninstalls on the Registrar's own notification thread, in the
-// order the changes were made. An uninstall is announced, and the observer has returned, before the
-// registration is removed; a refresh that changes a registration is announced as the uninstall of
-// the old record followed by the install of the new one.
+// Observers hear of installs and uninstalls through the Registrar's own notification queue, one
+// notification at a time, in the order the changes were made. Installs are delivered on its thread
+// after the commit. An uninstall is delivered synchronously, on the thread that removes the
+// registration while it holds that queue, and every observer has returned before the registration
+// is removed; an observer may itself register or unregister from a notification. A refresh that
+// changes a registration is announced as the uninstall of the old record followed by the install
+// of the new one.
 //
 // Every lookup may be made from any thread; none waits for a registration in progress beyond the
 // moment its new records are published.
