@@ -13,6 +13,7 @@
 #include <string>
 #include <vector>
 
+#include "bench/BenchRatios.h"
 #include "bench/BenchValues.h"
 #include "platform/Cbor.h"
 #include "platform/CborDecoder.h"
@@ -602,18 +603,9 @@ BENCHMARK_CAPTURE(decodeBench, request, "request");
 BENCHMARK_CAPTURE(decodeDirectBench, request, "request");
 
 // Prints, after the table, the ratios the codec choice rests on (all from this one run).
-class RatioReporter : public benchmark::ConsoleReporter {
-public:
-    void ReportRuns(const std::vector<Run>& runs) override
-    {
-        for (const auto& run : runs) {
-            if (run.run_type == Run::RT_Iteration && run.iterations > 0)
-                m_seconds[run.run_name.str()].push_back(run.cpu_accumulated_time / static_cast<double>(run.iterations));
-        }
-        ConsoleReporter::ReportRuns(runs);
-    }
-
-    void Finalize() override
+class CodecRatios : public RatioReporter {
+protected:
+    void printRatios() override
     {
         std::printf("\nratios (CPU time per operation, median of the repetitions)\n");
         for (const char* name : { "pluginInfo", "annotationTable", "request" }) {
@@ -623,7 +615,6 @@ public:
                 name);
             ratio(std::string("libcbor encode / direct encode ") + name, "encodeBench", "encodeDirectBench", name);
         }
-        ConsoleReporter::Finalize();
     }
 
 private:
@@ -634,18 +625,6 @@ private:
         if (n > 0 && d > 0)
             std::printf("  %-60s %6.2f\n", label.c_str(), n / d);
     }
-
-    double median(const std::string& name)
-    {
-        auto it = m_seconds.find(name);
-        if (it == m_seconds.end())
-            return 0;
-        auto& samples = it->second;
-        std::sort(samples.begin(), samples.end());
-        return samples[samples.size() / 2];
-    }
-
-    std::map<std::string, std::vector<double>> m_seconds;
 };
 
 } // namespace
@@ -653,11 +632,5 @@ private:
 
 int main(int argc, char** argv)
 {
-    benchmark::Initialize(&argc, argv);
-    if (benchmark::ReportUnrecognizedArguments(argc, argv))
-        return 1;
-    om::bench::RatioReporter reporter;
-    benchmark::RunSpecifiedBenchmarks(&reporter);
-    benchmark::Shutdown();
-    return 0;
+    return om::bench::runWithRatios<om::bench::CodecRatios>(argc, argv);
 }

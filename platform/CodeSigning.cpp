@@ -142,14 +142,14 @@ Result<std::optional<std::vector<uint8_t>>> readSection(int fd, uint64_t fileSiz
     return std::optional<std::vector<uint8_t>>(std::move(bytes));
 }
 
-bool ownerMayGrant(const struct stat& info)
+} // namespace
+
+bool CodeSigningTask::ownerMayGrant(const struct stat& info)
 {
     bool owner = info.st_uid == 0 || info.st_uid == ::geteuid();
     bool othersMayWrite = (info.st_mode & (S_IWGRP | S_IWOTH)) != 0;
     return S_ISREG(info.st_mode) && owner && !othersMayWrite;
 }
-
-} // namespace
 
 CodeSigningTask::CodeSigningTask(bool trusted, Value entitlements, std::optional<OMError> error)
     : m_trusted(trusted)

@@ -7,6 +7,8 @@
 // anyone else could have given themselves any entitlement.
 #pragma once
 
+#include <sys/stat.h>
+
 #include <memory>
 #include <optional>
 #include <string_view>
@@ -35,6 +37,9 @@ public:
     // file of this machine's byte order or has no such section; a dictionary otherwise. Every
     // offset and size in the file is checked against the file's size before it is used.
     static Result<Value> readEntitlements(int fd);
+    // Whether a file with this status may grant entitlements: a regular file owned by root or by
+    // our effective user, writable by neither group nor others.
+    static bool ownerMayGrant(const struct stat& info);
 
 private:
     CodeSigningTask(bool trusted, Value entitlements, std::optional<OMError> error);

@@ -14,15 +14,19 @@
 // visible is the daemon's decision. Registering a registered path again refreshes it and keeps its
 // UUID while its identifier is unchanged.
 //
-// Observers hear of installs and uninstalls on the Registrar's own notification thread, in the
-// order the changes were made. An uninstall is announced, and the observer has returned, before the
-// registration is removed; a refresh that changes a registration is announced as the uninstall of
-// the old record followed by the install of the new one.
+// Observers hear of installs and uninstalls through the Registrar's own notification queue, one
+// notification at a time, in the order the changes were made. Installs are delivered on its thread
+// after the commit. An uninstall is delivered synchronously, on the thread that removes the
+// registration while it holds that queue, and every observer has returned before the registration
+// is removed; an observer may itself register or unregister from a notification. A refresh that
+// changes a registration is announced as the uninstall of the old record followed by the install
+// of the new one.
 //
 // Every lookup may be made from any thread; none waits for a registration in progress beyond the
 // moment its new records are published.
 #pragma once
 
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <string>
@@ -36,6 +40,14 @@
 #include "platform/Value.h"
 
 namespace om {
+
+inline constexpr const char* kRegistrarErrorDomain = "Registrar";
+enum RegistrarErrorCode : int64_t {
+    kRegistrarErrorRefused = 1, // the bundle is no plug-in, or its path cannot name one
+    kRegistrarErrorNotRegistered = 2, // nothing is registered at the path
+    kRegistrarErrorDatabase = 3, // the database cannot be opened, read or written
+    kRegistrarErrorReadOnly = 4, // the workspace was opened for reading only
+};
 
 class RegistrarObserver {
 public:
@@ -105,6 +117,11 @@ public:
     // Registers the plug-in bundle at bundlePath (canonicalised here). The error says why the
     // bundle is refused.
     Result<std::shared_ptr<const RegistrarPlugInRecord>> registerPlugIn(std::string_view bundlePath);
+    // For installers and tools that register many bundles at once: each path is checked as by
+    // registerPlugIn(), and everything accepted is committed together, with one wait for the disk.
+    // One result per path, in order; a refused bundle does not keep the others out.
+    std::vector<Result<std::shared_ptr<const RegistrarPlugInRecord>>> registerPlugIns(
+        const std::vector<std::string>& bundlePaths);
     // Unregisters the plug-in registered at bundlePath; an error when none is. The bundle need not
     // exist on disk any more.
     Result<void> unregisterPlugIn(std::string_view bundlePath);

@@ -3,12 +3,15 @@
 #pragma once
 
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 
 #include "platform/Value.h"
 
 namespace om {
+
+class Bundle;
 
 class RegistrarAppRecord {
 public:
@@ -19,6 +22,7 @@ public:
     };
 
     explicit RegistrarAppRecord(Facts facts);
+    ~RegistrarAppRecord();
 
     const std::string& path() const { return m_facts.path; }
     const std::optional<std::string>& bundleIdentifier() const { return m_facts.bundleIdentifier; }
@@ -33,7 +37,12 @@ public:
     std::string description() const;
 
 private:
+    std::shared_ptr<const Bundle> bundle() const;
+
     const Facts m_facts;
+    // The handle caches Info.vlist by file stamp, so a placeholder check costs a few stat calls.
+    mutable std::mutex m_bundleMutex;
+    mutable std::shared_ptr<const Bundle> m_bundle;
 };
 
 } // namespace om

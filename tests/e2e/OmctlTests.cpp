@@ -19,7 +19,9 @@
 #include <thread>
 
 #include "platform/Conduit.h"
+#include "platform/Registrar.h"
 #include "platform/Vlist.h"
+#include "tests/support/BundleFixture.h"
 #include "tests/support/DaemonProcess.h"
 #include "tests/support/RawConduitPeer.h"
 
@@ -538,4 +540,69 @@ TEST_F(OmctlTest, InputPastTheSizeLimitIsRefused)
 
     EXPECT_EQ(result.status, 2);
     EXPECT_NE(result.err.find("longer than"), std::string::npos) << result.err;
+}
+
+// "registrar dump" reads the Registrar's database itself, with no daemon anywhere.
+class OmctlRegistrarDump : public OmctlTest {
+protected:
+    std::string database() const { return m_bundles.root() + "/registrar.db"; }
+    Outcome dump(std::vector<std::string> extra = {})
+    {
+        std::vector<std::string> arguments = { "registrar", "dump", "--database", database() };
+        arguments.insert(arguments.end(), extra.begin(), extra.end());
+        return omctl(arguments, m_directory);
+    }
+
+    om::test::BundleFixture m_bundles;
+};
+
+TEST_F(OmctlRegistrarDump, ListsApplicationsWithTheirPlugInsThenLooseOnes)
+{
+    std::string app = m_bundles.makeApp("Notes", "com.orvex.notes");
+    std::string inApp = m_bundles.makePlugIn(app, "Share", "com.orvex.notes.share", "com.orvex.share");
+    std::string loose = m_bundles.makeBundle("Loose.appex",
+        om::test::BundleFixture::plugInInfo(
+            "com.orvex.loose", "", "com.orvex.widget", Value::dictionary({ { "QSExtensionVersion", "4.2" } })));
+    std::string uuid;
+    {
+        RegistrarWorkspace::Configuration configuration { .databasePath = database(),
+            .sdkDirectory = m_bundles.root() + "/sdk",
+            .containersDirectory = m_bundles.root() + "/containers" };
+        auto workspace = RegistrarWorkspace::open(configuration, RegistrarWorkspace::Access::ReadWrite);
+        ASSERT_TRUE(workspace.ok());
+        auto record = workspace.value()->registerPlugIn(inApp);
+        ASSERT_TRUE(record.ok() && workspace.value()->registerPlugIn(loose).ok());
+        uuid = record.value()->uuid().string();
+
+        // Read while the writer still has the database open.
+        Outcome json = dump({ "--json" });
+        EXPECT_EQ(json.status, 0) << json.err;
+        for (const std::string& expected :
+            std::vector<std::string> { "\"path\": \"" + app + "\"", "\"identifier\": \"com.orvex.notes\"",
+                "{\"$uuid\": \"" + uuid + "\"}", "\"identifier\": \"com.orvex.notes.share\"", "\"version\": \"1.0\"",
+                "\"extensionPoint\": \"com.orvex.share\"", "\"path\": \"" + inApp + "\"",
+                "\"container\": \"" + m_bundles.root() + "/containers/com.orvex.notes.share\"", "\"version\": \"4.2\"",
+                "\"placeholder\": false" })
+            EXPECT_NE(json.out.find(expected), std::string::npos) << expected << "\n" << json.out;
+        EXPECT_LT(json.out.find("com.orvex.notes.share"), json.out.find("com.orvex.loose"));
+    }
+    Outcome human = dump();
+    EXPECT_EQ(human.status, 0) << human.err;
+    EXPECT_NE(human.out.find(uuid), std::string::npos) << human.out;
+    EXPECT_NE(human.out.find("com.orvex.widget"), std::string::npos) << human.out;
+}
+
+TEST_F(OmctlRegistrarDump, MissingDatabaseIsAnErrorAndUsageMistakesAreTwo)
+{
+    Outcome missing = dump();
+    EXPECT_EQ(missing.status, 1);
+    EXPECT_NE(missing.err.find("omctl: registrar database " + database() + ": "), std::string::npos) << missing.err;
+    EXPECT_FALSE(std::filesystem::exists(database()));
+
+    for (const std::vector<std::string>& arguments : std::vector<std::vector<std::string>> { { "registrar" },
+             { "registrar", "list" }, { "registrar", "dump", "--database" }, { "registrar", "dump", "extra" } }) {
+        Outcome usage = omctl(arguments, m_directory);
+        EXPECT_EQ(usage.status, 2) << usage.err;
+        EXPECT_NE(usage.err.find("Try 'omctl --help'"), std::string::npos) << usage.err;
+    }
 }

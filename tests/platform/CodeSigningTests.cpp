@@ -2,11 +2,9 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <poll.h>
-#include <spawn.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
-#include <sys/wait.h>
 #include <unistd.h>
 
 #include <cstring>
@@ -18,45 +16,19 @@
 #include "platform/UniqueFd.h"
 #include "platform/Vlist.h"
 #include "tests/support/BundleFixture.h"
-
-extern char** environ;
+#include "tests/support/ChildProcess.h"
 
 using om::CodeSigningTask;
 using om::UniqueFd;
 using om::Value;
 using om::test::BundleFixture;
+using om::test::ChildProcess;
 
 namespace {
 
 constexpr int kGenerousTimeoutMs = 30'000;
 const std::string kEntitle = std::string(OM_SOURCE_DIR) + "/scripts/entitle";
 const std::string kPeer = std::string(OM_BINARY_DIR) + "/tests/om_test_peer";
-
-int exitStatusOf(pid_t pid)
-{
-    int status = 0;
-    while (::waitpid(pid, &status, 0) < 0) {
-        if (errno != EINTR)
-            return -1;
-    }
-    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-}
-
-pid_t spawn(const std::vector<std::string>& arguments)
-{
-    std::vector<char*> argv;
-    for (const auto& argument : arguments)
-        argv.push_back(const_cast<char*>(argument.c_str()));
-    argv.push_back(nullptr);
-    pid_t pid;
-    return ::posix_spawn(&pid, argv[0], nullptr, nullptr, argv.data(), environ) == 0 ? pid : -1;
-}
-
-int run(const std::vector<std::string>& arguments)
-{
-    pid_t pid = spawn(arguments);
-    return pid < 0 ? -1 : exitStatusOf(pid);
-}
 
 bool waitReadable(int fd)
 {
@@ -77,8 +49,9 @@ protected:
 
     std::string entitle(const std::string& peer, const std::string& contents)
     {
-        EXPECT_EQ(
-            run({ kEntitle, peer, m_fixture.writeFile("entitlements" + std::to_string(m_files++), contents) }), 0);
+        EXPECT_EQ(ChildProcess::run(
+                      { kEntitle, peer, m_fixture.writeFile("entitlements" + std::to_string(m_files++), contents) }),
+            0);
         return peer;
     }
     std::string entitled(const Value& entitlements) { return entitle(copyPeer(), om::Vlist::writeXml(entitlements)); }
@@ -92,12 +65,12 @@ protected:
         sockaddr_un address { .sun_family = AF_UNIX, .sun_path = {} };
         std::strncpy(address.sun_path, socketPath.c_str(), sizeof address.sun_path - 1);
         if (::bind(listener.get(), reinterpret_cast<sockaddr*>(&address), sizeof address) < 0
-            || ::listen(listener.get(), 1) < 0 || (m_pid = spawn({ program, socketPath })) < 0)
+            || ::listen(listener.get(), 1) < 0 || (m_pid = ChildProcess::spawn({ program, socketPath })) < 0)
             return std::nullopt;
         *exitStatus = -1;
         if (!waitReadable(listener.get())) {
             ::kill(m_pid, SIGKILL);
-            exitStatusOf(m_pid);
+            ChildProcess::exitStatusOf(m_pid);
             return std::nullopt;
         }
         UniqueFd connection(::accept4(listener.get(), nullptr, nullptr, SOCK_CLOEXEC));
@@ -107,7 +80,7 @@ protected:
         EXPECT_TRUE(token.ok());
         m_task = token.ok() ? CodeSigningTask::create(token.value()) : nullptr;
         connection.reset(); // the peer's cue to exit
-        *exitStatus = exitStatusOf(m_pid);
+        *exitStatus = ChildProcess::exitStatusOf(m_pid);
         return token.ok() ? std::optional(token.value()) : std::nullopt;
     }
 
@@ -229,14 +202,14 @@ TEST(EntitleScript, RefusesWhatItCannotUse)
     std::string junk = fixture.writeFile("junk.vlist", "{\"a\": true}");
     std::string script = fixture.writeFile("script", "#!/bin/sh\n", 0755);
 
-    EXPECT_EQ(run({ kEntitle }), 2);
-    EXPECT_EQ(run({ kEntitle, peer }), 2);
-    EXPECT_EQ(run({ kEntitle, peer, empty }), 1);
-    EXPECT_EQ(run({ kEntitle, peer, junk }), 1);
-    EXPECT_EQ(run({ kEntitle, peer, fixture.root() + "/missing.vlist" }), 1);
-    EXPECT_EQ(run({ kEntitle, script, good }), 1);
-    EXPECT_EQ(run({ kEntitle, fixture.root() + "/missing", good }), 1);
-    EXPECT_EQ(run({ kEntitle, peer, good }), 0);
+    EXPECT_EQ(ChildProcess::run({ kEntitle }), 2);
+    EXPECT_EQ(ChildProcess::run({ kEntitle, peer }), 2);
+    EXPECT_EQ(ChildProcess::run({ kEntitle, peer, empty }), 1);
+    EXPECT_EQ(ChildProcess::run({ kEntitle, peer, junk }), 1);
+    EXPECT_EQ(ChildProcess::run({ kEntitle, peer, fixture.root() + "/missing.vlist" }), 1);
+    EXPECT_EQ(ChildProcess::run({ kEntitle, script, good }), 1);
+    EXPECT_EQ(ChildProcess::run({ kEntitle, fixture.root() + "/missing", good }), 1);
+    EXPECT_EQ(ChildProcess::run({ kEntitle, peer, good }), 0);
 }
 
 // Hostile executables: the reader must refuse a table that points outside the file, never read

@@ -7,6 +7,7 @@
 
 #include "platform/Format.h"
 #include "tools/omctl/OmctlDiagnostics.h"
+#include "tools/omctl/OmctlRegistrar.h"
 
 namespace om {
 
@@ -16,6 +17,8 @@ const OmctlCommand::Entry kCommands[] = {
     { "raw", "send a request dictionary (vlist file or JSON) and print the reply", OmctlDiagnostics::kRawHelp,
         OmctlDiagnostics::raw },
     { "ping", "check that omd answers, with the round-trip time", OmctlDiagnostics::kPingHelp, OmctlDiagnostics::ping },
+    { "registrar", "list registered apps and plug-ins from the Registrar's database", OmctlRegistrar::kHelp,
+        OmctlRegistrar::registrar },
 };
 
 bool isHelp(std::string_view argument)
