@@ -97,6 +97,20 @@ bool Storage::isSafeComponent(std::string_view text)
         && text.find_first_of(std::string_view("/\0", 2)) == std::string_view::npos;
 }
 
+Result<std::string> Storage::canonicalPath(std::string_view path, size_t limit)
+{
+    if (path.find('\0') != std::string_view::npos)
+        return OMError::fromErrno("realpath", EINVAL);
+    char* resolved = ::realpath(std::string(path).c_str(), nullptr);
+    if (!resolved)
+        return OMError::fromErrno("realpath " + std::string(path), errno);
+    std::string result(resolved);
+    std::free(resolved);
+    if (result.size() >= limit)
+        return OMError::fromErrno("realpath " + std::string(path), ENAMETOOLONG);
+    return result;
+}
+
 Result<void> Storage::makeDirectories(const std::string& path, unsigned mode)
 {
     if (path.empty())

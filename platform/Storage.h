@@ -40,6 +40,10 @@ public:
     // at most 255 bytes.
     static bool isSafeComponent(std::string_view text);
 
+    // The canonical form of an absolute path (symbolic links, "." and ".." resolved), which must
+    // exist and fit in limit bytes with its terminating NUL.
+    static Result<std::string> canonicalPath(std::string_view path, size_t limit = 1024);
+
     // mkdir -p, with mode for the directories it makes.
     static Result<void> makeDirectories(const std::string& path, unsigned mode = 0755);
     enum class Existing : uint8_t { Replace, Keep };
