@@ -1,0 +1,75 @@
+// OMDPlugIn: the plug-in record the daemon works with, built from the Registrar's record of one
+// registration. It keeps that record (rgproxy) and answers its key lookups, info dictionary and
+// display names from it, so the daemon never reads a plug-in's bundle itself.
+//
+// The source is split by concern: OMDPlugIn.cpp (construction, lookups, entitlements, checks,
+// the form's resource tokens); the matching, access and readying operations join it in files of
+// their own.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <string_view>
+
+#include "Ombrel/OMPlugInCore.h"
+#include "platform/Registrar.h"
+
+namespace om {
+
+class OMDPlugIn final : public OMPlugInCore {
+public:
+    // None when the Registrar's record has no bundle path or no identifier, or the plug-in fails
+    // its configuration check (logged).
+    static std::shared_ptr<OMDPlugIn> initWithRGData(std::shared_ptr<const RegistrarPlugInRecord> record);
+
+    const std::shared_ptr<const RegistrarPlugInRecord>& rgproxy() const { return m_rgproxy; }
+    // The UUID the Registrar gave the registration; present once constructed.
+    const Uuid& registrationUuid() const { return m_rgproxy->uuid(); }
+
+    Value infoKey(std::string_view key) const override;
+    Value pluginKey(std::string_view key) const override;
+    Value attribute(std::string_view key) const override;
+    Value bundleInfoDictionary() const override;
+
+    // Filled from the Registrar at the first read that finds them unset.
+    std::optional<std::string> localizedName() const override;
+    void setLocalizedName(std::optional<std::string> name) override;
+    std::optional<std::string> localizedShortName() const override;
+    void setLocalizedShortName(std::optional<std::string> name) override;
+    std::optional<std::string> localizedContainingName() const override;
+    void setLocalizedContainingName(std::optional<std::string> name) override;
+
+    Value valueForEntitlement(std::string_view key) const;
+    // Held unless absent, false or numerically zero.
+    bool hasEntitlement(std::string_view key) const;
+    // Where the plug-in's annotations live: the identifier it replaces (its
+    // "com.orvex.developer.replace-plugin" entitlement, when a string), else its own.
+    std::string annotationKey() const;
+
+    // The core checks, then a data container for every plug-in that is not a data plug-in, and a
+    // place in /System/ for a plug-in outside any application.
+    std::optional<OMError> diagnose() const override;
+    // A copy of info without the keys beginning "DT" (build facts).
+    static Value prunedInfoDictionaryFor(const Value& info);
+
+    // Adds "extensions": a token for each resource the plug-in shares ("." alone for an app
+    // extension), when it shares any.
+    void augmentForm(DictionaryBuilder& form) const;
+    // Tokens for resources ("." for the bundle itself), keyed by name as given.
+    Value issueResourceExtensions(const Value& resources) const;
+
+private:
+    explicit OMDPlugIn(std::shared_ptr<const RegistrarPlugInRecord> record)
+        : m_rgproxy(std::move(record))
+    {
+    }
+
+    const std::shared_ptr<const RegistrarPlugInRecord> m_rgproxy;
+    mutable std::mutex m_namesMutex;
+    mutable std::optional<std::string> m_localizedName;
+    mutable std::optional<std::string> m_localizedShortName;
+    mutable std::optional<std::string> m_localizedContainingName;
+};
+
+} // namespace om
