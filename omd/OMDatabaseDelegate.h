@@ -2,13 +2,9 @@
 // gone. The server is the one delegate: it stops the plug-ins' running instances.
 #pragma once
 
-#include <memory>
-#include <vector>
+#include "platform/RegistrarPlugInRecord.h"
 
 namespace om {
-
-class RegistrarPlugInRecord;
-using RegistrarPlugInRecords = std::vector<std::shared_ptr<const RegistrarPlugInRecord>>;
 
 class OMDatabaseDelegate {
 public:

@@ -22,6 +22,7 @@
 #include "platform/Conduit.h"
 #include "platform/Format.h"
 #include "platform/Log.h"
+#include "platform/Registrar.h"
 #include "platform/Value.h"
 
 namespace om::test {
@@ -66,6 +67,18 @@ private:
     std::shared_ptr<ConduitConnection> m_connection;
 };
 
+// Makes a Registrar of its own under root the process's workspace, so that whatever a server of
+// the test registers stays in the test's directory and no earlier test's registrations show.
+inline std::shared_ptr<RegistrarWorkspace> useFreshRegistrar(const std::string& root)
+{
+    RegistrarWorkspace::Configuration configuration { root + "/registrar.db", root + "/sdk", root + "/containers" };
+    auto workspace = RegistrarWorkspace::open(configuration, RegistrarWorkspace::Access::ReadWrite);
+    EXPECT_TRUE(workspace.ok()) << workspace.error().localizedDescription();
+    auto opened = workspace.ok() ? workspace.value() : nullptr;
+    RegistrarWorkspace::setDefaultWorkspace(opened);
+    return opened;
+}
+
 class InProcessServer : public ::testing::Test {
 protected:
     void SetUp() override
@@ -75,6 +88,9 @@ protected:
         ::setenv("CONDUIT_DIR", m_root.c_str(), 1);
         static std::atomic<int> serial { 0 };
         m_serviceName = "com.orvex.ombrel.omd.test" + std::to_string(++serial);
+        for (const char* suffix : { "", "-wal", "-shm" })
+            std::filesystem::remove(m_root + "/registrar.db" + suffix);
+        m_registrar = useFreshRegistrar(m_root);
         m_server = OMDServer::initForService(m_serviceName, m_root + "/annotations.vlist");
         ASSERT_TRUE(m_server);
         m_server->startListening();
@@ -122,6 +138,7 @@ protected:
     Log::Capture m_log;
     std::string m_root;
     std::string m_serviceName;
+    std::shared_ptr<RegistrarWorkspace> m_registrar;
     std::shared_ptr<OMDServer> m_server;
 };
 

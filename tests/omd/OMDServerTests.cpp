@@ -88,6 +88,7 @@ protected:
         ASSERT_TRUE(::mkdtemp(pattern.data()));
         m_root = pattern;
         m_path = m_root + "/annotations.vlist";
+        useFreshRegistrar(m_root);
     }
     void TearDown() override
     {
