@@ -4,6 +4,7 @@
 #pragma once
 
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -16,6 +17,7 @@
 namespace om {
 
 class OMDConduitClient;
+class OMDPlugIn;
 class OMDServer;
 
 // Protocol versions a request may carry.
@@ -52,6 +54,20 @@ public:
     uint64_t version() const { return m_version; }
     void setVersion(uint64_t version) { m_version = version; }
     bool replied() const { return m_replied; }
+
+    // Called once per path of "paths" with the canonical path (resolved) or the path as sent (not
+    // resolved). Answers true to go on; false once it has ended the request with fail().
+    using PathHandler = std::function<bool(const std::string& path, bool resolved)>;
+    // Called once per plug-in named by "uuids"; same contract.
+    using PlugInHandler = std::function<bool(const std::shared_ptr<OMDPlugIn>& plugIn)>;
+
+    // Walks "paths" (TransactionRegistration.cpp). False after a failure, already reported.
+    bool marshalPaths(const PathHandler& handler);
+    // marshalPaths, then done() when every path was handled.
+    bool processPaths(const PathHandler& handler);
+    // Walks "uuids", looking each plug-in up. False after a failure, already reported; never
+    // ends the request on success.
+    bool processUuidList(const PlugInHandler& handler);
 
     const std::shared_ptr<OMDServer>& server() const;
     // Null once the peer's connection object is gone.
