@@ -1,10 +1,11 @@
-// ChildProcess: runs the small programs tests need (scripts/entitle, peer programs) with the
-// test's own environment.
+// ChildProcess: runs the small programs tests need (scripts/entitle, peer programs, omctl) with the
+// test's own environment, or with settings of its own and its output collected.
 #pragma once
 
 #include <sys/types.h>
 
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace om::test {
@@ -17,6 +18,16 @@ public:
     static int exitStatusOf(pid_t pid);
     // spawn() and exitStatusOf() together.
     static int run(const std::vector<std::string>& arguments);
+
+    struct Outcome {
+        int status = -1; // exit status; -1 when it did not exit normally
+        std::string out;
+        std::string err;
+    };
+    // Runs a program to its end with settings overriding the test's environment, feeding it input
+    // on standard input and collecting what it writes.
+    static Outcome capture(const std::vector<std::string>& arguments,
+        const std::vector<std::pair<std::string, std::string>>& settings = {}, const std::string& input = {});
 };
 
 } // namespace om::test

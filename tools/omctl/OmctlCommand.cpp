@@ -7,6 +7,7 @@
 
 #include "platform/Format.h"
 #include "tools/omctl/OmctlDiagnostics.h"
+#include "tools/omctl/OmctlRegistration.h"
 #include "tools/omctl/OmctlRegistrar.h"
 
 namespace om {
@@ -17,6 +18,8 @@ const OmctlCommand::Entry kCommands[] = {
     { "raw", "send a request dictionary (vlist file or JSON) and print the reply", OmctlDiagnostics::kRawHelp,
         OmctlDiagnostics::raw },
     { "ping", "check that omd answers, with the round-trip time", OmctlDiagnostics::kPingHelp, OmctlDiagnostics::ping },
+    { "add", "register plug-in bundles", OmctlRegistration::kAddHelp, OmctlRegistration::add },
+    { "remove", "unregister plug-in bundles", OmctlRegistration::kRemoveHelp, OmctlRegistration::remove },
     { "registrar", "list registered apps and plug-ins from the Registrar's database", OmctlRegistrar::kHelp,
         OmctlRegistrar::registrar },
 };
