@@ -67,12 +67,14 @@ TEST_F(RegistrarNotification, ObserverMayChangeTheRegistryFromItsNotification)
     auto observer = observe();
     // Installing a takes it straight out again; uninstalling it takes b along.
     observer->onInstall = [&](const RegistrarPlugInRecords& records) {
-        if (records[0]->identifier() == "com.orvex.a")
+        if (records[0]->identifier() == "com.orvex.a") {
             EXPECT_TRUE(workspace()->unregisterPlugIn(a).ok());
+        }
     };
     observer->onUninstall = [&](const RegistrarPlugInRecords& records) {
-        if (records[0]->identifier() == "com.orvex.a")
+        if (records[0]->identifier() == "com.orvex.a") {
             EXPECT_TRUE(workspace()->unregisterPlugIn(b).ok());
+        }
     };
     registered(b);
     registered(a);
@@ -155,8 +157,9 @@ TEST_F(RegistrarConcurrency, LookupsRunWhileManyThreadsRegister)
         threads.emplace_back([&, writer] {
             for (size_t i = 0; i < paths[writer].size(); ++i) {
                 EXPECT_TRUE(space->registerPlugIn(paths[writer][i]).ok());
-                if (i % 4 == 3)
+                if (i % 4 == 3) {
                     EXPECT_TRUE(space->unregisterPlugIn(paths[writer][i]).ok());
+                }
             }
             --writing;
         });
