@@ -146,9 +146,9 @@ std::optional<OMError> OMDatabase::addPlugIn(std::string_view url)
 {
     const std::string path = pathOf(url);
     auto registered = m_workspace->registerPlugIn(path);
+    // The Registrar has logged why it refused.
     if (registered.ok())
         return std::nullopt;
-    OMLog::rg().info("Registrar refused plug-in at %@: %@", path, registered.error().localizedDescription());
     return OMMakeError(2, "Registrar failed to register the plug-in");
 }
 
@@ -158,7 +158,6 @@ std::optional<OMError> OMDatabase::removePlugIn(std::string_view url)
     auto unregistered = m_workspace->unregisterPlugIn(path);
     if (unregistered.ok())
         return std::nullopt;
-    OMLog::rg().info("Registrar refused to unregister %@: %@", path, unregistered.error().localizedDescription());
     return OMMakeError(2, "Registrar failed to deregister the plug-in");
 }
 
