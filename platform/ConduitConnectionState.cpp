@@ -293,6 +293,7 @@ void ConduitConnection::State::closeNow(std::optional<OMError> protocolError)
         m_socket.reset();
         m_reader = ConduitFrameReader();
     }
+    ConduitIoThread::shared().descriptorFreed();
     if (protocolError)
         ConduitIoThread::log().error(
             "protocol error on connection to pid %d: %s; closing it", peerPid(), protocolError->localizedDescription());

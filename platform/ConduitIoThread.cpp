@@ -5,9 +5,12 @@
 #include <sys/eventfd.h>
 #include <sys/signalfd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <cstdint>
 #include <cstdlib>
 #include <cstring>
+#include <utility>
 
 #include "platform/ConduitConnectionState.h"
 #include "platform/Fatal.h"
@@ -149,6 +152,23 @@ void ConduitIoThread::remove(int fd, uint64_t key)
     m_sources.erase(found);
 }
 
+void ConduitIoThread::after(std::chrono::milliseconds delay, std::function<void()> work)
+{
+    m_timers.emplace(std::chrono::steady_clock::now() + delay, std::move(work));
+}
+
+void ConduitIoThread::whenDescriptorFreed(std::function<void()> work)
+{
+    m_descriptorWaiters.push_back(std::move(work));
+}
+
+void ConduitIoThread::descriptorFreed()
+{
+    // Posted: the caller is closing a connection inside its own event handler.
+    for (auto& work : std::exchange(m_descriptorWaiters, {}))
+        post(std::move(work));
+}
+
 void ConduitIoThread::modify(int fd, uint64_t key, uint32_t events)
 {
     epoll_event event {};
@@ -162,7 +182,7 @@ void ConduitIoThread::loop()
 {
     epoll_event events[kEventsPerRound];
     for (;;) {
-        const int count = ::epoll_wait(m_epoll.get(), events, kEventsPerRound, -1);
+        const int count = ::epoll_wait(m_epoll.get(), events, kEventsPerRound, waitTimeout());
         if (count < 0) {
             if (errno == EINTR)
                 continue;
@@ -185,6 +205,29 @@ void ConduitIoThread::loop()
         // has nothing posted; skipping the drain saves a read(2) per request.
         if (woken)
             runPosted();
+        runDueTimers();
+    }
+}
+
+// Milliseconds until the earliest timer, rounded up so that the loop never wakes just before it
+// and spins through zero timeouts; -1 (forever) without timers.
+int ConduitIoThread::waitTimeout() const
+{
+    if (m_timers.empty())
+        return -1;
+    const auto left = m_timers.begin()->first - std::chrono::steady_clock::now();
+    if (left <= std::chrono::steady_clock::duration::zero())
+        return 0;
+    return int(std::min<int64_t>(std::chrono::ceil<std::chrono::milliseconds>(left).count(), INT32_MAX));
+}
+
+void ConduitIoThread::runDueTimers()
+{
+    const auto now = std::chrono::steady_clock::now();
+    while (!m_timers.empty() && m_timers.begin()->first <= now) {
+        auto work = std::move(m_timers.begin()->second);
+        m_timers.erase(m_timers.begin());
+        work();
     }
 }
 
