@@ -22,6 +22,18 @@
 namespace om::test {
 namespace {
 
+using Bytes = std::vector<uint8_t>;
+
+constexpr uint64_t kMiB = uint64_t(1) << 20;
+
+// Under the sanitizers, memory is the sanitizer allocator's (quarantined, shadowed): the daemon's
+// resident size then says nothing about what the daemon itself holds.
+#if defined(__SANITIZE_ADDRESS__) || defined(__SANITIZE_THREAD__)
+constexpr bool kNativeAllocator = false;
+#else
+constexpr bool kNativeAllocator = true;
+#endif
+
 std::unique_ptr<DaemonProcess> startDaemon(DaemonProcess::Options options)
 {
     options.executable = builtDaemonPath();
@@ -143,6 +155,113 @@ TEST(DaemonOutOfDescriptors, TurnsClientsAwayWithoutSpinningThenServesAgain)
             lines.begin(), lines.end(), [&](const auto& line) { return line.message.starts_with(recovered); });
     }));
     EXPECT_TRUE(daemon->running());
+}
+
+// {"request": "ping", "version": 3} as a request frame with id.
+Bytes pingFrame(uint64_t id)
+{
+    return RawConduitPeer::frame(RawConduitPeer::kRequest, id, Cbor::encode(daemonRequest("ping")));
+}
+
+TEST(DaemonOutboundBound, NonReadingClientCostsAboutTheBoundAndNothingOnceGone)
+{
+    if (!kNativeAllocator)
+        GTEST_SKIP() << "resident memory is the sanitizer allocator's";
+    constexpr uint64_t kBound = 8 * kMiB;
+    constexpr uint64_t kSlack = 8 * kMiB; // the daemon's own churn while it answers 160,000 requests
+    constexpr size_t kBatch = 1000;
+    DaemonProcess::Options options;
+    options.logLevel = "default"; // a debug line per request would be most of the test
+    options.environment = { { "CONDUIT_MAX_PENDING", std::to_string(kBound) } };
+    auto daemon = startDaemon(options);
+    ASSERT_TRUE(daemon->waitForSocket()) << daemon->stderrText();
+
+    auto bystander = DaemonPeer::connect(*daemon);
+    ASSERT_TRUE(bystander);
+    for (int i = 0; i < 200; ++i)
+        ASSERT_TRUE(bystander->call(daemonRequest("ping")));
+    const uint64_t before = daemon->residentBytes().value_or(0);
+
+    auto silent = RawConduitPeer::connect(daemon->socketPath());
+    ASSERT_TRUE(silent);
+    int small = 4096;
+    ASSERT_EQ(::setsockopt(silent->fd(), SOL_SOCKET, SO_RCVBUF, &small, sizeof small), 0);
+    // Batches of requests, each followed by a bystander's round trip, so that the daemon answers
+    // as fast as they come: the client is cut off for what it leaves unread, not for requests
+    // waiting. A send fails once the daemon has closed the connection.
+    uint64_t peak = before, id = 0;
+    bool cutOff = false;
+    for (uint64_t batch = 0; batch < 4 * kBound / 50 / kBatch && !cutOff; ++batch) {
+        Bytes bytes;
+        for (size_t i = 0; i < kBatch; ++i) {
+            auto frame = pingFrame(++id);
+            bytes.insert(bytes.end(), frame.begin(), frame.end());
+        }
+        cutOff = !silent->sendBytes(bytes);
+        ASSERT_TRUE(bystander->call(daemonRequest("ping")));
+        peak = std::max(peak, daemon->residentBytes().value_or(0));
+    }
+    ASSERT_TRUE(cutOff) << "never disconnected after " << id << " requests";
+
+    const std::string reason = format("protocol error on connection to pid %d: peer stopped reading (", ::getpid());
+    ASSERT_TRUE(daemon->waitForLines([&](const std::vector<DaemonLogLine>& lines) {
+        return std::any_of(
+            lines.begin(), lines.end(), [&](const auto& line) { return line.message.starts_with(reason); });
+    }));
+    unsigned long long pending = 0;
+    for (const auto& line : daemon->lines()) {
+        if (line.message.starts_with(reason))
+            (void)std::sscanf(line.message.c_str() + reason.size(), "%llu", &pending);
+    }
+    EXPECT_GT(pending, kBound) << "disconnected before the bound";
+    EXPECT_LE(pending, kBound + 64) << "disconnected by more than one reply past the bound";
+    EXPECT_LE(peak - before, 2 * kBound + kSlack) << "resident growth while the client was connected";
+
+    silent.reset();
+    ASSERT_TRUE(bystander->call(daemonRequest("ping")));
+    const uint64_t after = daemon->residentBytes().value_or(UINT64_MAX);
+    EXPECT_LE(after, before + kBound / 2) << "resident growth after the client left";
+    EXPECT_EQ(linesContaining(*daemon, "peer stopped reading"), 1u) << "one line per reason per connection";
+}
+
+TEST(DaemonLargeFrames, ConcurrentLargestRequestsLeaveNothingResident)
+{
+    if (!kNativeAllocator)
+        GTEST_SKIP() << "resident memory is the sanitizer allocator's";
+    constexpr int kClients = 4;
+    DaemonProcess::Options options;
+    options.logLevel = "default";
+    auto daemon = startDaemon(options);
+    ASSERT_TRUE(daemon->waitForSocket()) << daemon->stderrText();
+    auto bystander = DaemonPeer::connect(*daemon);
+    ASSERT_TRUE(bystander);
+    ASSERT_TRUE(bystander->call(daemonRequest("ping")));
+    const uint64_t before = daemon->residentBytes().value_or(0);
+
+    // A payload just under the frame limit: the map's other entries and the heads take the rest.
+    Value large = Value::dictionary({ { "request", Value::string("ping") }, { "version", Value(uint64_t(3)) },
+        { "blob", Value::data(Bytes(Conduit::kMaxPayload - 64, 0x5a)) } });
+    Bytes frame = RawConduitPeer::frame(RawConduitPeer::kRequest, 1, Cbor::encode(large));
+    ASSERT_LE(frame.size(), 13 + Conduit::kMaxPayload);
+    std::vector<Outcome> outcomes(kClients, Outcome::LeftWaiting);
+    {
+        std::vector<std::thread> clients;
+        for (int c = 0; c < kClients; ++c) {
+            clients.emplace_back([&, c] {
+                auto peer = RawConduitPeer::connect(daemon->socketPath());
+                if (peer && peer->sendBytes(frame))
+                    outcomes[size_t(c)] = outcomeOf(*peer);
+            });
+        }
+        for (auto& client : clients)
+            client.join();
+    }
+    for (int c = 0; c < kClients; ++c)
+        EXPECT_EQ(outcomes[size_t(c)], Outcome::Served) << "client " << c;
+
+    ASSERT_TRUE(bystander->call(daemonRequest("ping")));
+    const uint64_t after = daemon->residentBytes().value_or(UINT64_MAX);
+    EXPECT_LE(after, before + 8 * kMiB) << "resident growth after " << kClients << " requests of 16 MiB";
 }
 
 } // namespace
