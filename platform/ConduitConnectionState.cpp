@@ -224,7 +224,7 @@ void ConduitConnection::State::readAvailable()
         if (errno == EINTR)
             continue;
         if (errno != EAGAIN && errno != EWOULDBLOCK) {
-            ConduitIoThread::log().debug("connection to pid %d: recv: %s", peerPid(), std::strerror(errno));
+            ConduitIoThread::log().debug("connection to pid %d: recv: %s", peerPid(), OMError::errnoDescription(errno));
             closeNow(std::nullopt);
         }
         return;

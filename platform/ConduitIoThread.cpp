@@ -84,12 +84,12 @@ ConduitIoThread::ConduitIoThread()
 {
     if (!m_epoll.valid() || !m_wake.valid())
         internalInconsistency(
-            std::string("conduit I/O thread: cannot create epoll or eventfd: ") + std::strerror(errno));
+            std::string("conduit I/O thread: cannot create epoll or eventfd: ") + OMError::errnoDescription(errno));
     epoll_event event {};
     event.events = EPOLLIN;
     event.data.u64 = kWakeKey;
     if (::epoll_ctl(m_epoll.get(), EPOLL_CTL_ADD, m_wake.get(), &event) < 0)
-        internalInconsistency(std::string("conduit I/O thread: epoll_ctl: ") + std::strerror(errno));
+        internalInconsistency(std::string("conduit I/O thread: epoll_ctl: ") + OMError::errnoDescription(errno));
 
     // The thread is born with SIGTERM blocked, so that it never takes the signal's default action
     // in place of the signalfd, whenever exitOnTermination() is called.
@@ -133,7 +133,7 @@ uint64_t ConduitIoThread::add(int fd, uint32_t events, std::shared_ptr<Source> s
     event.events = events;
     event.data.u64 = key;
     if (::epoll_ctl(m_epoll.get(), EPOLL_CTL_ADD, fd, &event) < 0) {
-        log().error("epoll_ctl(ADD) of descriptor %d: %s", fd, std::strerror(errno));
+        log().error("epoll_ctl(ADD) of descriptor %d: %s", fd, OMError::errnoDescription(errno));
         return 0;
     }
     m_sources[fd] = Registration { key, std::move(source) };
@@ -175,7 +175,7 @@ void ConduitIoThread::modify(int fd, uint64_t key, uint32_t events)
     event.events = events;
     event.data.u64 = key;
     if (::epoll_ctl(m_epoll.get(), EPOLL_CTL_MOD, fd, &event) < 0)
-        log().error("epoll_ctl(MOD) of descriptor %d: %s", fd, std::strerror(errno));
+        log().error("epoll_ctl(MOD) of descriptor %d: %s", fd, OMError::errnoDescription(errno));
 }
 
 void ConduitIoThread::loop()
@@ -186,7 +186,7 @@ void ConduitIoThread::loop()
         if (count < 0) {
             if (errno == EINTR)
                 continue;
-            internalInconsistency(std::string("conduit I/O thread: epoll_wait: ") + std::strerror(errno));
+            internalInconsistency(std::string("conduit I/O thread: epoll_wait: ") + OMError::errnoDescription(errno));
         }
         bool woken = false;
         for (int i = 0; i < count; ++i) {
@@ -263,7 +263,7 @@ void ConduitIoThread::exitOnTermination()
     sigaddset(&signals, SIGTERM);
     UniqueFd fd(::signalfd(-1, &signals, SFD_CLOEXEC | SFD_NONBLOCK));
     if (!fd.valid()) {
-        log().error("signalfd: %s; SIGTERM keeps its default action", std::strerror(errno));
+        log().error("signalfd: %s; SIGTERM keeps its default action", OMError::errnoDescription(errno));
         return;
     }
     auto source = std::make_shared<TerminationSignal>(std::move(fd), [this] { terminate(); });
@@ -294,8 +294,9 @@ void ConduitIoThread::terminate()
 
 void ConduitIoThread::exitWhenIdle()
 {
+    // Every other thread is idle or blocked by now: nothing races the static destructors.
     if (s_keepAlives.load() == 0)
-        std::exit(0);
+        std::exit(0); // NOLINT(concurrency-mt-unsafe)
 }
 
 void ConduitIoThread::keepAliveOpened()

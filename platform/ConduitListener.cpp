@@ -260,8 +260,8 @@ void ConduitListener::State::acceptPending(ConduitListener& owner)
 void ConduitListener::State::outOfResources(ConduitListener& owner, int listening, int error)
 {
     if (!std::exchange(exhausted, true))
-        ConduitIoThread::log().error(
-            "accept on %s: %s; turning new connections away until resources are freed", path, std::strerror(error));
+        ConduitIoThread::log().error("accept on %s: %s; turning new connections away until resources are freed", path,
+            OMError::errnoDescription(error));
     if (isDescriptorShortage(error))
         turnedAway += turnAwayWaitingPeers(listening);
     pauseAccepting(owner);

@@ -40,7 +40,7 @@ void ProcessResources::returnLargeAllocationsPromptly()
 {
     // Setting the threshold also fixes it (and the trim threshold) for good. Allocators other than
     // glibc's, as under the sanitizers, ignore it.
-    (void)::mallopt(M_MMAP_THRESHOLD, int(kLargeAllocation));
+    (void)::mallopt(M_MMAP_THRESHOLD, int(kLargeAllocation)); // NOLINT(concurrency-mt-unsafe): at start-up
 }
 
 } // namespace om
