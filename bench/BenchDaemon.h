@@ -33,32 +33,29 @@ namespace om::bench {
 
 inline constexpr size_t kFrameHeaderSize = 13;
 
-inline bool writeAll(int fd, const uint8_t* bytes, size_t size)
+// Calls step(done, left), a read or a write of the bytes after the first done, until size bytes
+// have moved; false on an error or the end of the stream.
+template <typename Step> bool moveAll(size_t size, Step step)
 {
-    while (size > 0) {
-        ssize_t count = ::write(fd, bytes, size);
+    for (size_t done = 0; done < size;) {
+        ssize_t count = step(done, size - done);
         if (count < 0 && errno == EINTR)
             continue;
         if (count <= 0)
             return false;
-        bytes += count;
-        size -= static_cast<size_t>(count);
+        done += static_cast<size_t>(count);
     }
     return true;
 }
 
+inline bool writeAll(int fd, const uint8_t* bytes, size_t size)
+{
+    return moveAll(size, [&](size_t done, size_t left) { return ::write(fd, bytes + done, left); });
+}
+
 inline bool readAll(int fd, uint8_t* bytes, size_t size)
 {
-    while (size > 0) {
-        ssize_t count = ::read(fd, bytes, size);
-        if (count < 0 && errno == EINTR)
-            continue;
-        if (count <= 0)
-            return false;
-        bytes += count;
-        size -= static_cast<size_t>(count);
-    }
-    return true;
+    return moveAll(size, [&](size_t done, size_t left) { return ::read(fd, bytes + done, left); });
 }
 
 inline uint32_t frameLengthOf(const uint8_t* header)
