@@ -224,9 +224,8 @@ void WorkQueue::sync(const std::function<void()>& work)
 {
     if (isCurrent())
         internalInconsistency("sync onto work queue \"" + m_label + "\" from code already running on it");
-    refuseCycle(); // from here on, the caller is recorded as waiting for this queue
-
     auto protect = shared_from_this(); // the closure may drop the caller's reference to this queue
+    refuseCycle(); // from here on, the caller is recorded as waiting for this queue
     auto barrier = std::make_shared<SyncBarrier>();
     async([barrier] { barrier->holdQueue(); });
     barrier->waitUntilHeld();
