@@ -34,6 +34,14 @@ constexpr bool kNativeAllocator = false;
 constexpr bool kNativeAllocator = true;
 #endif
 
+// The ASan+UBSan build's runtime checks a vtable by writing its memory into a pipe. A daemon out
+// of descriptors cannot open one, and the check then reports a false error.
+#if defined(__SANITIZE_ADDRESS__)
+constexpr bool kRuntimeNeedsDescriptors = true;
+#else
+constexpr bool kRuntimeNeedsDescriptors = false;
+#endif
+
 std::unique_ptr<DaemonProcess> startDaemon(DaemonProcess::Options options)
 {
     options.executable = builtDaemonPath();
@@ -87,6 +95,8 @@ template <typename Work> double cpuShareDuring(const DaemonProcess& daemon, Work
 
 TEST(DaemonOutOfDescriptors, TurnsClientsAwayWithoutSpinningThenServesAgain)
 {
+    if (kRuntimeNeedsDescriptors)
+        GTEST_SKIP() << "the sanitizer runtime cannot work without descriptors";
     DaemonProcess::Options options;
     options.descriptorLimit = 64; // soft and hard: the daemon cannot raise it
     auto daemon = startDaemon(options);
