@@ -102,8 +102,9 @@ Result<UniqueFd> bindListeningSocket(const std::string& path)
 // How long a listener that ran out of descriptors ignores its socket, unless one of the
 // transport's sockets closes first.
 constexpr std::chrono::milliseconds kAcceptBackoff { 100 };
-// Waiting peers turned away in one go; the backlog holds at most SOMAXCONN anyway.
-constexpr size_t kMostTurnedAwayAtOnce = 4096;
+// Waiting peers turned away in one round of the I/O thread; the rest wait for the next round, so
+// that a flood of them does not keep the other connections waiting.
+constexpr size_t kMostTurnedAwayAtOnce = 64;
 
 // One descriptor held back for the moment the process runs out: closing it makes room to accept
 // the waiting peers and close them, so that they learn at once that they will not be served.
@@ -125,25 +126,38 @@ bool isDescriptorShortage(int error)
     return error == EMFILE || error == ENFILE;
 }
 
-// Accepts and closes every peer waiting on listening, through the spare descriptor, which is
-// restored only after the last of them is closed so that its slot is free again. The count.
-uint64_t turnAwayWaitingPeers(int listening)
-{
-    if (!spareDescriptor().valid())
-        return 0;
-    spareDescriptor().reset();
+struct TurnedAway {
     uint64_t count = 0;
-    while (count < kMostTurnedAwayAtOnce) {
-        UniqueFd peer(::accept4(listening, nullptr, nullptr, SOCK_CLOEXEC));
-        if (peer.valid()) {
-            ++count;
-            continue;
-        }
-        if (errno != EINTR && errno != ECONNABORTED)
+    bool backlogLeft = false; // stopped at kMostTurnedAwayAtOnce with peers still waiting
+    bool roomAgain = false; // a descriptor was freed meanwhile: the next peer may be served
+};
+
+// Accepts and closes the peers waiting on listening, through the spare descriptor, which is
+// restored only after the last of them is closed so that its slot is free again. Stops as soon
+// as a descriptor can be had besides, so that peers arriving once others have left are served.
+TurnedAway turnAwayWaitingPeers(int listening)
+{
+    TurnedAway result;
+    if (!spareDescriptor().valid())
+        return result;
+    spareDescriptor().reset();
+    while (!result.roomAgain) {
+        if (result.count == kMostTurnedAwayAtOnce) {
+            result.backlogLeft = true;
             break;
+        }
+        UniqueFd peer(::accept4(listening, nullptr, nullptr, SOCK_CLOEXEC));
+        if (!peer.valid()) {
+            if (errno == EINTR || errno == ECONNABORTED)
+                continue;
+            break;
+        }
+        ++result.count;
+        restoreSpareDescriptor(); // takes a slot only if one was freed since
+        result.roomAgain = spareDescriptor().valid();
     }
     restoreSpareDescriptor();
-    return count;
+    return result;
 }
 
 } // namespace
@@ -262,8 +276,13 @@ void ConduitListener::State::outOfResources(ConduitListener& owner, int listenin
     if (!std::exchange(exhausted, true))
         ConduitIoThread::log().error("accept on %s: %s; turning new connections away until resources are freed", path,
             OMError::errnoDescription(error));
-    if (isDescriptorShortage(error))
-        turnedAway += turnAwayWaitingPeers(listening);
+    if (isDescriptorShortage(error)) {
+        const TurnedAway result = turnAwayWaitingPeers(listening);
+        turnedAway += result.count;
+        // Still watched, the socket brings the I/O thread back on its next round.
+        if (result.backlogLeft || result.roomAgain)
+            return;
+    }
     pauseAccepting(owner);
 }
 

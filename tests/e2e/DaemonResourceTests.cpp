@@ -151,7 +151,7 @@ TEST(DaemonOutOfDescriptors, TurnsClientsAwayWithoutSpinningThenServesAgain)
     // when one arrives; it is then closed, never left waiting.
     served.clear();
     bool servedAgain = false;
-    for (int attempt = 0; attempt < 50 && !servedAgain; ++attempt) {
+    for (int attempt = 0; attempt < 200 && !servedAgain; ++attempt) {
         auto peer = connectAndAsk(*daemon);
         ASSERT_TRUE(peer);
         const Outcome outcome = outcomeOf(*peer);
