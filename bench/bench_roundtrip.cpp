@@ -10,14 +10,9 @@
 // The raw cases also time an echo that answers from one serial work queue, as omd answers from its
 // "service" queue: the floor for any design that hands every request to another thread.
 #include <benchmark/benchmark.h>
-#include <fcntl.h>
-#include <signal.h>
 #include <stdlib.h>
-#include <sys/prctl.h>
 #include <sys/socket.h>
 #include <sys/un.h>
-#include <sys/wait.h>
-#include <time.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -34,95 +29,15 @@
 #include <vector>
 
 #include "Ombrel/OMDaemonClient.h"
-#include "platform/Cbor.h"
-
-extern char** environ;
+#include "bench/BenchDaemon.h"
 
 namespace {
 
+using namespace om::bench;
 using Clock = std::chrono::steady_clock;
 
 constexpr const char* kServiceName = "com.orvex.bench.roundtrip";
 constexpr size_t kRequestsPerBatch = 4000;
-constexpr size_t kHeaderSize = 13;
-
-bool writeAll(int fd, const uint8_t* bytes, size_t size)
-{
-    while (size > 0) {
-        ssize_t count = ::write(fd, bytes, size);
-        if (count < 0 && errno == EINTR)
-            continue;
-        if (count <= 0)
-            return false;
-        bytes += count;
-        size -= static_cast<size_t>(count);
-    }
-    return true;
-}
-
-bool readAll(int fd, uint8_t* bytes, size_t size)
-{
-    while (size > 0) {
-        ssize_t count = ::read(fd, bytes, size);
-        if (count < 0 && errno == EINTR)
-            continue;
-        if (count <= 0)
-            return false;
-        bytes += count;
-        size -= static_cast<size_t>(count);
-    }
-    return true;
-}
-
-uint32_t lengthOf(const uint8_t* header)
-{
-    return static_cast<uint32_t>(header[0]) | static_cast<uint32_t>(header[1]) << 8
-        | static_cast<uint32_t>(header[2]) << 16 | static_cast<uint32_t>(header[3]) << 24;
-}
-
-// Reads one whole frame into buffer (header included).
-bool readFrame(int fd, std::vector<uint8_t>& buffer)
-{
-    buffer.resize(kHeaderSize);
-    if (!readAll(fd, buffer.data(), kHeaderSize))
-        return false;
-    uint32_t length = lengthOf(buffer.data());
-    if (length < 9 || length > 9 + (16u << 20))
-        return false;
-    buffer.resize(4 + length);
-    return readAll(fd, buffer.data() + kHeaderSize, length - 9);
-}
-
-int connectTo(const std::string& path)
-{
-    int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    sockaddr_un address = {};
-    address.sun_family = AF_UNIX;
-    std::strncpy(address.sun_path, path.c_str(), sizeof address.sun_path - 1);
-    if (fd >= 0 && ::connect(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0)
-        return fd;
-    if (fd >= 0)
-        ::close(fd);
-    return -1;
-}
-
-// A request frame for "ping", version 3; the id is patched per request.
-std::vector<uint8_t> pingFrame()
-{
-    auto payload = om::Cbor::encode(om::Value::dictionary({ { "request", "ping" }, { "version", 3u } }));
-    uint32_t length = static_cast<uint32_t>(9 + payload.size());
-    std::vector<uint8_t> frame = { static_cast<uint8_t>(length), static_cast<uint8_t>(length >> 8),
-        static_cast<uint8_t>(length >> 16), static_cast<uint8_t>(length >> 24), 2 };
-    frame.resize(kHeaderSize, 0);
-    frame.insert(frame.end(), payload.begin(), payload.end());
-    return frame;
-}
-
-void setId(std::vector<uint8_t>& frame, uint64_t id)
-{
-    for (int i = 0; i < 8; ++i)
-        frame[5 + static_cast<size_t>(i)] = static_cast<uint8_t>(id >> (8 * i));
-}
 
 // The baseline: one thread per connection that reads a frame and writes it straight back. With a
 // hop queue, the write happens on that one serial queue instead, as the daemon answers from its
@@ -189,117 +104,6 @@ private:
     std::thread m_acceptor;
     std::mutex m_mutex;
     std::vector<std::thread> m_connections;
-};
-
-std::string daemonBinary()
-{
-    if (const char* path = ::getenv("OMD_BINARY"))
-        return path;
-    std::error_code error;
-    auto self = std::filesystem::read_symlink("/proc/self/exe", error);
-    return (self.parent_path().parent_path() / "omd" / "omd").string();
-}
-
-// The real daemon on a private directory, asked to stop when the benchmark ends (and killed by
-// the kernel should the benchmark die first).
-class Daemon {
-public:
-    explicit Daemon(const std::string& root)
-    {
-        std::string conduit = root + "/conduit";
-        std::filesystem::create_directories(conduit);
-        m_socketPath = conduit + "/" + kServiceName;
-
-        std::vector<std::string> settings = {
-            "CONDUIT_DIR=" + conduit,
-            "HOME=" + root + "/home",
-            "XDG_RUNTIME_DIR=" + root + "/runtime",
-            "XDG_DATA_HOME=" + root + "/data",
-            "XDG_CONFIG_HOME=" + root + "/config",
-            "REGISTRAR_DB=" + root + "/registrar.db",
-            "REGISTRAR_SDK_DIR=" + root + "/sdk",
-            "REGISTRAR_CONTAINERS=" + root + "/containers",
-            "CONSENT_DB=" + root + "/consent.db",
-            "PREFS_DIR=" + root + "/prefs",
-            "SANDBOX_KEY=" + root + "/sandbox.key",
-        };
-        for (char** entry = environ; *entry; ++entry) {
-            std::string_view name(*entry);
-            name = name.substr(0, name.find('='));
-            bool ours = std::any_of(settings.begin(), settings.end(),
-                [&](const std::string& setting) { return setting.starts_with(std::string(name) + "="); });
-            if (!ours)
-                settings.emplace_back(*entry);
-        }
-        std::string binary = daemonBinary();
-        std::vector<std::string> arguments = { binary, "-S", kServiceName };
-        std::vector<char*> argv, envp;
-        for (auto& argument : arguments)
-            argv.push_back(argument.data());
-        argv.push_back(nullptr);
-        for (auto& setting : settings)
-            envp.push_back(setting.data());
-        envp.push_back(nullptr);
-        std::string logPath = root + "/omd.log";
-        int log = ::open(logPath.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0600);
-
-        m_pid = ::fork();
-        if (m_pid == 0)
-            runChild(argv.data(), envp.data(), log);
-        if (log >= 0)
-            ::close(log);
-        if (m_pid < 0 || !waitForSocket())
-            std::fprintf(stderr, "cannot start %s (see %s)\n", binary.c_str(), logPath.c_str());
-    }
-
-    ~Daemon()
-    {
-        if (m_pid <= 0)
-            return;
-        ::kill(m_pid, SIGTERM);
-        int status;
-        ::waitpid(m_pid, &status, 0);
-    }
-
-    const std::string& socketPath() const { return m_socketPath; }
-    bool running() const { return m_running; }
-
-private:
-    [[noreturn]] static void runChild(char** argv, char** envp, int log)
-    {
-        ::prctl(PR_SET_PDEATHSIG, SIGKILL);
-        if (log >= 0) {
-            ::dup2(log, 1);
-            ::dup2(log, 2);
-        }
-        ::execve(argv[0], argv, envp);
-        ::_exit(127);
-    }
-
-    // Polls: a benchmark may wait, and the daemon gives no other sign of readiness.
-    bool waitForSocket()
-    {
-        for (int attempt = 0; attempt < 1000; ++attempt) {
-            int fd = connectTo(m_socketPath);
-            if (fd >= 0) {
-                ::close(fd);
-                m_running = true;
-                return true;
-            }
-            int status;
-            if (::waitpid(m_pid, &status, WNOHANG) == m_pid) {
-                m_pid = -1;
-                return false;
-            }
-            timespec pause = { 0, 10'000'000 };
-            ::nanosleep(&pause, nullptr);
-        }
-        return false;
-    }
-
-    std::string m_socketPath;
-    pid_t m_pid = -1;
-    bool m_running = false;
 };
 
 struct Batch {
@@ -412,7 +216,7 @@ Batch rawBatch(const std::string& path, int threads)
             return connection;
         },
         [](std::shared_ptr<RawConnection>& connection, uint64_t id) {
-            setId(connection->request, id);
+            setFrameId(connection->request, id);
             return writeAll(connection->fd, connection->request.data(), connection->request.size())
                 && readFrame(connection->fd, connection->reply);
         });
@@ -442,7 +246,7 @@ struct Environment {
     std::string root;
     std::unique_ptr<EchoServer> echo;
     std::unique_ptr<EchoServer> hopEcho;
-    std::unique_ptr<Daemon> daemon;
+    std::unique_ptr<BenchDaemon> daemon;
     std::map<std::string, std::string> summary;
 
     Environment()
@@ -453,7 +257,7 @@ struct Environment {
         echo = std::make_unique<EchoServer>(root + "/echo.sock", nullptr);
         hopEcho = std::make_unique<EchoServer>(
             root + "/hop-echo.sock", om::WorkQueue::create("echo-hop", om::QualityOfService::UserInitiated));
-        daemon = std::make_unique<Daemon>(root);
+        daemon = std::make_unique<BenchDaemon>(root, kServiceName);
     }
 
     ~Environment()

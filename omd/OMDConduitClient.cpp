@@ -68,10 +68,13 @@ void OMDConduitClient::submitRequest(const ConduitEvent& event)
         OM_PROBE2(request__input, pid, text.c_str());
     }
 
+    if (m_cutOff)
+        return;
     if (m_waitingRequests.fetch_add(1, std::memory_order_relaxed) >= kMaxWaitingRequests) {
         // A client this far ahead of its replies is misbehaving: it loses its own connection,
         // and the requests it already queued are dropped at dispatch like any dead client's.
         m_waitingRequests.fetch_sub(1, std::memory_order_relaxed);
+        m_cutOff = true;
         OMLog::ops().error("client %d has %u requests waiting; closing its connection", pid,
             static_cast<uint32_t>(kMaxWaitingRequests));
         if (auto connection = m_connection.lock())

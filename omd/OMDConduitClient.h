@@ -71,6 +71,10 @@ private:
     // racing with dead is either answered or dropped; both are fine.
     std::atomic<bool> m_acceptWork { true };
     std::atomic<uint32_t> m_waitingRequests { 0 }; // submitted, not yet dispatched
+    // Set once the client went over kMaxWaitingRequests. Its connection closes soon after, but
+    // the requests already decoded still arrive; they are dropped without another word. Touched
+    // only by the connection's serial event delivery.
+    bool m_cutOff = false;
     // Null when no signing identity could be made: every entitlement then counts as absent.
     std::shared_ptr<CodeSigningTask> _task;
     // Touched only on "service"; wraps at 2^32.

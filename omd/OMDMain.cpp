@@ -42,6 +42,7 @@ std::optional<OMDOptions> parseOMDOptions(int argc, char* const argv[])
     optind = 0;
     opterr = 0;
     int option;
+    // NOLINTNEXTLINE(concurrency-mt-unsafe): the command line is parsed once, on one thread.
     while ((option = ::getopt(argc, argv, "+c:d:S:v")) != -1) {
         switch (option) {
         case 'c':

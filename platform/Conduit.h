@@ -7,9 +7,15 @@
 // connection's target queue or, when it has none, on the I/O thread itself. Handlers that run on
 // the I/O thread must be short and must never block.
 //
+// Limits of the wire contract, the same for every peer: a frame's payload is at most 16 MiB
+// (kMaxPayload); its CBOR item nests at most 128 levels deep (Cbor::kMaxDepth) and consists of at
+// most 2^20 data items, every container, tag, map key and scalar counting as one
+// (Cbor::kMaxItems). A frame beyond any of them is invalid.
+//
 // Blame is explicit: a malformed frame, a reply to nothing, a frame over the limit or a peer whose
-// unread output exceeds CONDUIT_MAX_PENDING is a protocol error. It is logged, that connection is
-// closed, and nothing it decoded is delivered. Other connections never notice.
+// unread output would need more than CONDUIT_MAX_PENDING bytes of memory is a protocol error. It
+// is logged, that connection is closed, and nothing it decoded is delivered. Other connections
+// never notice.
 //
 // Lifetime: the transport holds each open connection; after it has delivered ConnectionInvalid
 // it drops the event handler (breaking handler -> owner -> connection cycles) and its reference.
@@ -101,6 +107,10 @@ private:
     std::unique_ptr<State> m_state;
 };
 
+// Out of descriptors, a listener accepts and closes the peers waiting on it at once, through a
+// spare descriptor it keeps for this, and stops watching its socket until one of the transport's
+// sockets closes or 100 ms pass: peers are served or closed, never left waiting, and the I/O
+// thread does not spin. One log line starts such an episode and one ends it, with a count.
 class ConduitListener : public std::enable_shared_from_this<ConduitListener> {
 public:
     using ConnectionHandler = std::function<void(std::shared_ptr<ConduitConnection>)>;
@@ -133,7 +143,8 @@ public:
     static bool isValidServiceName(const std::string& serviceName);
     // Largest frame payload accepted and sent (16 MiB).
     static constexpr uint32_t kMaxPayload = 16u << 20;
-    // CONDUIT_MAX_PENDING (bytes), default 64 MiB.
+    // CONDUIT_MAX_PENDING (bytes), default 64 MiB: the memory one connection's unwritten output may
+    // take, allocation and all.
     static size_t maxPendingBytes();
     // Overrides CONDUIT_MAX_PENDING for the rest of the process (tests of the outbound bound).
     static void setMaxPendingBytesForTesting(size_t bytes);

@@ -120,7 +120,7 @@ std::shared_ptr<void> ConduitConnection::context() const
 std::string ConduitConnection::description() const
 {
     char address[32];
-    std::snprintf(address, sizeof address, "%p", static_cast<const void*>(this));
+    (void)std::snprintf(address, sizeof address, "%p", static_cast<const void*>(this));
     return "<ConduitConnection " + std::string(address) + " " + m_state->describe() + ">";
 }
 

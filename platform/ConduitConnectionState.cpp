@@ -12,6 +12,9 @@ namespace {
 constexpr size_t kReadChunk = 64 * 1024;
 // Bytes read from one connection per I/O round before the others get their turn.
 constexpr size_t kReadBudget = 1024 * 1024;
+// Output a connection keeps allocated once everything is written: replies usually go out
+// directly, so only a burst that met a full socket needs more, and it gives that back.
+constexpr size_t kRetainedOutbound = 64 * 1024;
 
 // Writes what the socket takes now: the count written, or -1 with errno when the peer is gone.
 ssize_t sendSome(int fd, const uint8_t* bytes, size_t size)
@@ -48,6 +51,7 @@ ConduitConnection::State::State(ConduitConnection& owner, Role role, UniqueFd so
     , m_name(std::move(name))
     , m_owner(owner)
     , m_socket(std::move(socket))
+    , m_outbound(kRetainedOutbound)
 {
     if (!m_socket.valid())
         m_closed = m_invalid = true;
@@ -134,7 +138,7 @@ void ConduitConnection::State::write(
         ConduitFrame::setId(frame.value(), id);
         m_pending.emplace(id, std::move(*reply));
     }
-    enqueueLocked(std::move(frame).releaseValue());
+    enqueueLocked(frame.value());
 }
 
 void ConduitConnection::State::terminationImminent()
@@ -142,30 +146,25 @@ void ConduitConnection::State::terminationImminent()
     write(ConduitFrame::Kind::TerminationImminent, 0, Value(), std::nullopt);
 }
 
-void ConduitConnection::State::enqueueLocked(std::vector<uint8_t> frame)
+void ConduitConnection::State::enqueueLocked(std::span<const uint8_t> frame)
 {
-    size_t offset = 0;
     if (m_outbound.empty() && m_socket.valid()) {
         const ssize_t written = sendSome(m_socket.get(), frame.data(), frame.size());
         if (written < 0)
             return; // the peer is gone; reading will see the end of the stream
-        offset = size_t(written);
-        if (offset == frame.size())
+        frame = frame.subspan(size_t(written));
+        if (frame.empty())
             return;
     }
-    m_outboundBytes += frame.size() - offset;
-    if (m_outboundBytes > Conduit::maxPendingBytes()) {
+    if (!m_outbound.append(frame, Conduit::maxPendingBytes())) {
         m_invalid = true;
-        const size_t pending = m_outboundBytes;
+        const size_t pending = m_outbound.size() + frame.size();
         ConduitIoThread::shared().post([self = m_owner.shared_from_this(), pending] {
             self->m_state->closeNow(OMError::platform(
                 kPlatformErrorLimit, "peer stopped reading (" + std::to_string(pending) + " bytes pending)"));
         });
         return;
     }
-    if (m_outbound.empty())
-        m_frontOffset = offset;
-    m_outbound.push_back(std::move(frame));
     armWriteLocked();
 }
 
@@ -180,20 +179,14 @@ void ConduitConnection::State::armWriteLocked()
 void ConduitConnection::State::flush()
 {
     std::lock_guard lock(m_mutex);
-    while (!m_outbound.empty() && m_socket.valid()) {
-        auto& front = m_outbound.front();
-        const ssize_t written = sendSome(m_socket.get(), front.data() + m_frontOffset, front.size() - m_frontOffset);
-        if (written < 0) {
+    if (!m_outbound.empty() && m_socket.valid()) {
+        const ssize_t written = sendSome(m_socket.get(), m_outbound.data(), m_outbound.size());
+        if (written < 0)
             m_outbound.clear(); // the peer is gone; reading will see the end of the stream
-            m_outboundBytes = 0;
-            break;
-        }
-        m_frontOffset += size_t(written);
-        m_outboundBytes -= size_t(written);
-        if (m_frontOffset < front.size())
+        else
+            m_outbound.consume(size_t(written));
+        if (!m_outbound.empty())
             return; // EAGAIN: stay armed
-        m_outbound.pop_front();
-        m_frontOffset = 0;
     }
     if (m_writeArmed && m_ioKey != 0) {
         ConduitIoThread::shared().modify(m_socket.get(), m_ioKey, EPOLLIN | EPOLLRDHUP);
@@ -231,7 +224,7 @@ void ConduitConnection::State::readAvailable()
         if (errno == EINTR)
             continue;
         if (errno != EAGAIN && errno != EWOULDBLOCK) {
-            ConduitIoThread::log().debug("connection to pid %d: recv: %s", peerPid(), std::strerror(errno));
+            ConduitIoThread::log().debug("connection to pid %d: recv: %s", peerPid(), OMError::errnoDescription(errno));
             closeNow(std::nullopt);
         }
         return;
@@ -294,13 +287,13 @@ void ConduitConnection::State::closeNow(std::optional<OMError> protocolError)
         m_closed = m_invalid = true;
         pending.swap(m_pending);
         m_outbound.clear();
-        m_outboundBytes = 0;
         if (m_ioKey != 0)
             ConduitIoThread::shared().remove(m_socket.get(), m_ioKey);
         m_ioKey = 0;
         m_socket.reset();
         m_reader = ConduitFrameReader();
     }
+    ConduitIoThread::shared().descriptorFreed();
     if (protocolError)
         ConduitIoThread::log().error(
             "protocol error on connection to pid %d: %s; closing it", peerPid(), protocolError->localizedDescription());

@@ -8,14 +8,15 @@
 #pragma once
 
 #include <atomic>
-#include <deque>
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <span>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
+#include "platform/ByteQueue.h"
 #include "platform/Conduit.h"
 #include "platform/ConduitFrame.h"
 #include "platform/ConduitIoThread.h"
@@ -61,7 +62,7 @@ private:
     bool drainFrames();
     bool handleFrame(ConduitFrame frame);
     void flush();
-    void enqueueLocked(std::vector<uint8_t> frame);
+    void enqueueLocked(std::span<const uint8_t> frame);
     void armWriteLocked();
     void closeNow(std::optional<OMError> protocolError);
     void deliver(ConduitEvent event);
@@ -82,9 +83,8 @@ private:
     bool m_invalid = false; // no more output is accepted (closed, cancelled or over budget)
     uint64_t m_lastRequestId = 0;
     std::unordered_map<uint64_t, PendingReply> m_pending;
-    std::deque<std::vector<uint8_t>> m_outbound;
-    size_t m_frontOffset = 0; // bytes of m_outbound.front() already written
-    size_t m_outboundBytes = 0; // unwritten bytes in m_outbound
+    // Unwritten output, charged against Conduit::maxPendingBytes() by what it allocates.
+    ByteQueue m_outbound;
     uint64_t m_ioKey = 0; // registration with the I/O thread; 0 when not registered
     bool m_writeArmed = false;
 

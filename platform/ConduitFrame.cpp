@@ -1,5 +1,8 @@
 #include "platform/ConduitFrame.h"
 
+#include <algorithm>
+#include <cstdint>
+
 #include "platform/Cbor.h"
 #include "platform/CborDecoder.h"
 #include "platform/Conduit.h"
@@ -12,9 +15,6 @@ constexpr size_t kLengthSize = 4;
 constexpr size_t kKindOffset = 4;
 constexpr size_t kIdOffset = 5;
 constexpr uint64_t kMaxLength = ConduitFrame::kMinLength + uint64_t(Conduit::kMaxPayload);
-// A buffer that once held a large frame is given back when it empties, so that one big message
-// does not pin its size for the life of the connection.
-constexpr size_t kRetainedCapacity = 1u << 20;
 
 uint32_t readLe32(const uint8_t* bytes)
 {
@@ -106,16 +106,16 @@ void ConduitFrameReader::append(std::span<const uint8_t> bytes)
 {
     if (m_error || bytes.empty())
         return;
-    if (m_offset == m_buffer.size()) {
-        if (m_buffer.capacity() > kRetainedCapacity)
-            m_buffer = {};
-        m_buffer.clear();
-        m_offset = 0;
-    } else if (m_offset > 0 && m_offset >= m_buffer.size() / 2) {
-        m_buffer.erase(m_buffer.begin(), m_buffer.begin() + ptrdiff_t(m_offset));
-        m_offset = 0;
-    }
-    m_buffer.insert(m_buffer.end(), bytes.begin(), bytes.end());
+    // Growth stops at the end of the frame in progress, so that a frame of 16 MiB holds 16 MiB
+    // and not the next power of two. The buffer never holds a whole frame here (drained ones are
+    // consumed), so this only caps doubling; it never refuses.
+    size_t limit = m_buffer.size() + bytes.size();
+    if (m_buffer.size() >= kLengthSize)
+        limit = std::max<size_t>(limit, kLengthSize + readLe32(m_buffer.data()));
+    else
+        limit = SIZE_MAX;
+    if (!m_buffer.append(bytes, limit))
+        (void)fail("out of memory for a frame of " + std::to_string(limit) + " bytes");
 }
 
 // Judges the header of the frame in progress with whatever part of it has arrived, so that a bad
@@ -123,7 +123,7 @@ void ConduitFrameReader::append(std::span<const uint8_t> bytes)
 std::optional<OMError> ConduitFrameReader::checkHeader() const
 {
     const size_t available = buffered();
-    const uint8_t* header = m_buffer.data() + m_offset;
+    const uint8_t* header = m_buffer.data();
     if (available < kLengthSize)
         return std::nullopt;
     const uint32_t length = readLe32(header);
@@ -171,7 +171,7 @@ Result<std::optional<ConduitFrame>> ConduitFrameReader::next()
         return fail(problem->localizedDescription());
     if (buffered() < ConduitFrame::kHeaderSize)
         return std::optional<ConduitFrame>();
-    const uint8_t* header = m_buffer.data() + m_offset;
+    const uint8_t* header = m_buffer.data();
     const uint32_t length = readLe32(header);
     if (buffered() < kLengthSize + length)
         return std::optional<ConduitFrame>();
@@ -179,17 +179,17 @@ Result<std::optional<ConduitFrame>> ConduitFrameReader::next()
     ConduitFrame frame;
     frame.kind = ConduitFrame::Kind(header[kKindOffset]);
     frame.id = readLe64(header + kIdOffset);
-    std::span<const uint8_t> payload(header + ConduitFrame::kHeaderSize, length - ConduitFrame::kMinLength);
-    m_offset += kLengthSize + length;
-
     if (frame.kind == ConduitFrame::Kind::Request)
         m_lastRequestId = frame.id;
     if (frame.kind != ConduitFrame::Kind::TerminationImminent) {
-        auto decoded = Cbor::decode(payload);
+        // Decoded in place: the frame's bytes are consumed only afterwards.
+        auto decoded = Cbor::decode(
+            std::span<const uint8_t>(header + ConduitFrame::kHeaderSize, length - ConduitFrame::kMinLength));
         if (!decoded.ok())
             return fail("malformed payload: " + decoded.error().localizedDescription());
         frame.payload = std::move(decoded).releaseValue();
     }
+    m_buffer.consume(kLengthSize + length);
     return std::optional<ConduitFrame>(std::move(frame));
 }
 
@@ -202,14 +202,13 @@ std::optional<OMError> ConduitFrameReader::finish() const
             kPlatformErrorMalformed, "stream ended inside a frame header (" + std::to_string(buffered()) + " bytes)");
     return OMError::platform(kPlatformErrorMalformed,
         "stream ended inside a frame (" + std::to_string(buffered()) + " of "
-            + std::to_string(kLengthSize + readLe32(m_buffer.data() + m_offset)) + " bytes)");
+            + std::to_string(kLengthSize + readLe32(m_buffer.data())) + " bytes)");
 }
 
 OMError ConduitFrameReader::fail(std::string what)
 {
     m_error = OMError::platform(kPlatformErrorMalformed, std::move(what));
-    m_buffer = {};
-    m_offset = 0;
+    m_buffer.clear();
     return *m_error;
 }
 

@@ -13,6 +13,7 @@
 #include <string>
 #include <vector>
 
+#include "platform/ByteQueue.h"
 #include "platform/Result.h"
 #include "platform/Value.h"
 
@@ -41,6 +42,10 @@ struct ConduitFrame {
 
 class ConduitFrameReader {
 public:
+    // A buffer that once held a large frame is given back when it empties, so that one big
+    // message does not pin its size for the life of the connection.
+    static constexpr size_t kRetainedCapacity = 1u << 20;
+
     // Adds bytes as they arrived from the socket.
     void append(std::span<const uint8_t> bytes);
 
@@ -52,14 +57,14 @@ public:
     std::optional<OMError> finish() const;
 
     // Bytes held for frames not yet complete.
-    size_t buffered() const { return m_buffer.size() - m_offset; }
+    size_t buffered() const { return m_buffer.size(); }
 
 private:
     std::optional<OMError> checkHeader() const;
     OMError fail(std::string what);
 
-    std::vector<uint8_t> m_buffer;
-    size_t m_offset = 0; // start of the first unconsumed frame in m_buffer
+    // Starts with the first unconsumed frame.
+    ByteQueue m_buffer { kRetainedCapacity };
     uint64_t m_lastRequestId = 0; // request ids must increase per connection
     std::optional<OMError> m_error;
 };

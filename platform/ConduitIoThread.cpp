@@ -5,9 +5,12 @@
 #include <sys/eventfd.h>
 #include <sys/signalfd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <cstdint>
 #include <cstdlib>
 #include <cstring>
+#include <utility>
 
 #include "platform/ConduitConnectionState.h"
 #include "platform/Fatal.h"
@@ -81,12 +84,12 @@ ConduitIoThread::ConduitIoThread()
 {
     if (!m_epoll.valid() || !m_wake.valid())
         internalInconsistency(
-            std::string("conduit I/O thread: cannot create epoll or eventfd: ") + std::strerror(errno));
+            std::string("conduit I/O thread: cannot create epoll or eventfd: ") + OMError::errnoDescription(errno));
     epoll_event event {};
     event.events = EPOLLIN;
     event.data.u64 = kWakeKey;
     if (::epoll_ctl(m_epoll.get(), EPOLL_CTL_ADD, m_wake.get(), &event) < 0)
-        internalInconsistency(std::string("conduit I/O thread: epoll_ctl: ") + std::strerror(errno));
+        internalInconsistency(std::string("conduit I/O thread: epoll_ctl: ") + OMError::errnoDescription(errno));
 
     // The thread is born with SIGTERM blocked, so that it never takes the signal's default action
     // in place of the signalfd, whenever exitOnTermination() is called.
@@ -130,7 +133,7 @@ uint64_t ConduitIoThread::add(int fd, uint32_t events, std::shared_ptr<Source> s
     event.events = events;
     event.data.u64 = key;
     if (::epoll_ctl(m_epoll.get(), EPOLL_CTL_ADD, fd, &event) < 0) {
-        log().error("epoll_ctl(ADD) of descriptor %d: %s", fd, std::strerror(errno));
+        log().error("epoll_ctl(ADD) of descriptor %d: %s", fd, OMError::errnoDescription(errno));
         return 0;
     }
     m_sources[fd] = Registration { key, std::move(source) };
@@ -149,24 +152,41 @@ void ConduitIoThread::remove(int fd, uint64_t key)
     m_sources.erase(found);
 }
 
+void ConduitIoThread::after(std::chrono::milliseconds delay, std::function<void()> work)
+{
+    m_timers.emplace(std::chrono::steady_clock::now() + delay, std::move(work));
+}
+
+void ConduitIoThread::whenDescriptorFreed(std::function<void()> work)
+{
+    m_descriptorWaiters.push_back(std::move(work));
+}
+
+void ConduitIoThread::descriptorFreed()
+{
+    // Posted: the caller is closing a connection inside its own event handler.
+    for (auto& work : std::exchange(m_descriptorWaiters, {}))
+        post(std::move(work));
+}
+
 void ConduitIoThread::modify(int fd, uint64_t key, uint32_t events)
 {
     epoll_event event {};
     event.events = events;
     event.data.u64 = key;
     if (::epoll_ctl(m_epoll.get(), EPOLL_CTL_MOD, fd, &event) < 0)
-        log().error("epoll_ctl(MOD) of descriptor %d: %s", fd, std::strerror(errno));
+        log().error("epoll_ctl(MOD) of descriptor %d: %s", fd, OMError::errnoDescription(errno));
 }
 
 void ConduitIoThread::loop()
 {
     epoll_event events[kEventsPerRound];
     for (;;) {
-        const int count = ::epoll_wait(m_epoll.get(), events, kEventsPerRound, -1);
+        const int count = ::epoll_wait(m_epoll.get(), events, kEventsPerRound, waitTimeout());
         if (count < 0) {
             if (errno == EINTR)
                 continue;
-            internalInconsistency(std::string("conduit I/O thread: epoll_wait: ") + std::strerror(errno));
+            internalInconsistency(std::string("conduit I/O thread: epoll_wait: ") + OMError::errnoDescription(errno));
         }
         bool woken = false;
         for (int i = 0; i < count; ++i) {
@@ -185,6 +205,29 @@ void ConduitIoThread::loop()
         // has nothing posted; skipping the drain saves a read(2) per request.
         if (woken)
             runPosted();
+        runDueTimers();
+    }
+}
+
+// Milliseconds until the earliest timer, rounded up so that the loop never wakes just before it
+// and spins through zero timeouts; -1 (forever) without timers.
+int ConduitIoThread::waitTimeout() const
+{
+    if (m_timers.empty())
+        return -1;
+    const auto left = m_timers.begin()->first - std::chrono::steady_clock::now();
+    if (left <= std::chrono::steady_clock::duration::zero())
+        return 0;
+    return int(std::min<int64_t>(std::chrono::ceil<std::chrono::milliseconds>(left).count(), INT32_MAX));
+}
+
+void ConduitIoThread::runDueTimers()
+{
+    const auto now = std::chrono::steady_clock::now();
+    while (!m_timers.empty() && m_timers.begin()->first <= now) {
+        auto work = std::move(m_timers.begin()->second);
+        m_timers.erase(m_timers.begin());
+        work();
     }
 }
 
@@ -220,7 +263,7 @@ void ConduitIoThread::exitOnTermination()
     sigaddset(&signals, SIGTERM);
     UniqueFd fd(::signalfd(-1, &signals, SFD_CLOEXEC | SFD_NONBLOCK));
     if (!fd.valid()) {
-        log().error("signalfd: %s; SIGTERM keeps its default action", std::strerror(errno));
+        log().error("signalfd: %s; SIGTERM keeps its default action", OMError::errnoDescription(errno));
         return;
     }
     auto source = std::make_shared<TerminationSignal>(std::move(fd), [this] { terminate(); });
@@ -251,8 +294,9 @@ void ConduitIoThread::terminate()
 
 void ConduitIoThread::exitWhenIdle()
 {
+    // Every other thread is idle or blocked by now: nothing races the static destructors.
     if (s_keepAlives.load() == 0)
-        std::exit(0);
+        std::exit(0); // NOLINT(concurrency-mt-unsafe)
 }
 
 void ConduitIoThread::keepAliveOpened()

@@ -4,7 +4,9 @@
 // registration gets a key that carries a generation, so that an event queued for a descriptor
 // that was closed and reused in the same round is recognised as stale and dropped. The registry
 // holds each source strongly until it is removed. Work from other threads reaches the loop
-// through post(), which wakes it with an eventfd.
+// through post(), which wakes it with an eventfd. Timers need no descriptor of their own: the
+// loop's wait times out for the earliest one, so they work while the process is out of
+// descriptors, which is when the listener needs them.
 //
 // The thread starts on first use and is never stopped or destroyed: it may be the thread that
 // calls exit(), and nothing may run its destructor under it.
@@ -16,8 +18,10 @@
 #include <sys/epoll.h>
 
 #include <atomic>
+#include <chrono>
 #include <cstdint>
 #include <functional>
+#include <map>
 #include <memory>
 #include <mutex>
 #include <thread>
@@ -57,6 +61,13 @@ public:
     // Any thread, for a descriptor still registered under key.
     void modify(int fd, uint64_t key, uint32_t events);
 
+    // I/O thread only. Runs work on the I/O thread once delay has passed.
+    void after(std::chrono::milliseconds delay, std::function<void()> work);
+    // I/O thread only. Runs work (posted) the next time the transport closes one of its sockets.
+    void whenDescriptorFreed(std::function<void()> work);
+    // I/O thread only: a socket of the transport was just closed.
+    void descriptorFreed();
+
     // Peer connections: those accepted by a listener of this process.
     void addPeer(const std::shared_ptr<ConduitConnection>& connection);
 
@@ -68,7 +79,9 @@ public:
 private:
     ConduitIoThread();
     void loop();
+    int waitTimeout() const;
     void runPosted();
+    void runDueTimers();
     void terminate();
     void exitWhenIdle();
 
@@ -85,6 +98,8 @@ private:
     std::unordered_map<int, Registration> m_sources;
     uint32_t m_generation = 0;
     bool m_terminating = false;
+    std::multimap<std::chrono::steady_clock::time_point, std::function<void()>> m_timers;
+    std::vector<std::function<void()>> m_descriptorWaiters;
 
     std::mutex m_postedMutex;
     std::vector<std::function<void()>> m_posted;

@@ -5,7 +5,9 @@
 
 #include <atomic>
 #include <cerrno>
+#include <chrono>
 #include <cstring>
+#include <utility>
 
 #include "platform/Conduit.h"
 #include "platform/ConduitConnectionState.h"
@@ -97,6 +99,67 @@ Result<UniqueFd> bindListeningSocket(const std::string& path)
     return fd;
 }
 
+// How long a listener that ran out of descriptors ignores its socket, unless one of the
+// transport's sockets closes first.
+constexpr std::chrono::milliseconds kAcceptBackoff { 100 };
+// Waiting peers turned away in one round of the I/O thread; the rest wait for the next round, so
+// that a flood of them does not keep the other connections waiting.
+constexpr size_t kMostTurnedAwayAtOnce = 64;
+
+// One descriptor held back for the moment the process runs out: closing it makes room to accept
+// the waiting peers and close them, so that they learn at once that they will not be served.
+// I/O thread only.
+UniqueFd& spareDescriptor()
+{
+    static UniqueFd spare;
+    return spare;
+}
+
+void restoreSpareDescriptor()
+{
+    if (!spareDescriptor().valid())
+        spareDescriptor().reset(::open("/dev/null", O_RDONLY | O_CLOEXEC));
+}
+
+bool isDescriptorShortage(int error)
+{
+    return error == EMFILE || error == ENFILE;
+}
+
+struct TurnedAway {
+    uint64_t count = 0;
+    bool backlogLeft = false; // stopped at kMostTurnedAwayAtOnce with peers still waiting
+    bool roomAgain = false; // a descriptor was freed meanwhile: the next peer may be served
+};
+
+// Accepts and closes the peers waiting on listening, through the spare descriptor, which is
+// restored only after the last of them is closed so that its slot is free again. Stops as soon
+// as a descriptor can be had besides, so that peers arriving once others have left are served.
+TurnedAway turnAwayWaitingPeers(int listening)
+{
+    TurnedAway result;
+    if (!spareDescriptor().valid())
+        return result;
+    spareDescriptor().reset();
+    while (!result.roomAgain) {
+        if (result.count == kMostTurnedAwayAtOnce) {
+            result.backlogLeft = true;
+            break;
+        }
+        UniqueFd peer(::accept4(listening, nullptr, nullptr, SOCK_CLOEXEC));
+        if (!peer.valid()) {
+            if (errno == EINTR || errno == ECONNABORTED)
+                continue;
+            break;
+        }
+        ++result.count;
+        restoreSpareDescriptor(); // takes a slot only if one was freed since
+        result.roomAgain = spareDescriptor().valid();
+    }
+    restoreSpareDescriptor();
+    return result;
+}
+
 } // namespace
 
 struct ConduitListener::State {
@@ -125,6 +188,10 @@ struct ConduitListener::State {
 
     void start(const std::shared_ptr<ConduitListener>& owner);
     void acceptPending(ConduitListener& owner);
+    void outOfResources(ConduitListener& owner, int listening, int error);
+    void pauseAccepting(ConduitListener& owner);
+    void resumeAccepting();
+    void watchSocket(uint32_t events);
     void deliver(const std::shared_ptr<ConduitListener>& owner, std::shared_ptr<ConduitConnection> connection);
     void shutdown();
 
@@ -139,10 +206,20 @@ struct ConduitListener::State {
     uint64_t ioKey = 0;
     dev_t device = 0; // identity of the socket file we bound, so that we unlink only our own
     ino_t inode = 0;
+
+    // Running out of descriptors (or other resources accept needs), on the I/O thread only. While
+    // paused, the socket's readiness is not watched, so a backlog the process cannot take never
+    // spins the loop; one episode, from the first failure to the next served peer, logs twice.
+    bool paused = false;
+    uint64_t pauseCount = 0; // tells a back-off timer of an earlier pause from the current one's
+    bool awaitingDescriptor = false;
+    bool exhausted = false;
+    uint64_t turnedAway = 0; // peers closed unserved in this episode
 };
 
 void ConduitListener::State::start(const std::shared_ptr<ConduitListener>& owner)
 {
+    restoreSpareDescriptor();
     std::lock_guard lock(mutex);
     if (cancelled.load() || !socket->valid())
         return;
@@ -153,43 +230,99 @@ void ConduitListener::State::start(const std::shared_ptr<ConduitListener>& owner
 
 void ConduitListener::State::acceptPending(ConduitListener& owner)
 {
-    // One descriptor held back for the moment the process runs out: closing it lets us accept
-    // and drop the waiting peer, instead of the listener staying readable and spinning the loop.
-    static int reserve = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
     std::shared_ptr<UniqueFd> listening;
     {
         std::lock_guard lock(mutex);
         listening = socket; // shutdown() may swap it out from another thread
     }
-    if (!listening->valid())
+    if (!listening->valid() || paused)
         return;
     for (;;) {
         UniqueFd peer(::accept4(listening->get(), nullptr, nullptr, SOCK_CLOEXEC | SOCK_NONBLOCK));
         if (!peer.valid()) {
             if (errno == EINTR || errno == ECONNABORTED)
                 continue;
-            if ((errno == EMFILE || errno == ENFILE) && reserve >= 0) {
-                ConduitIoThread::log().error("accept on %s: %s; dropping a peer", path, std::strerror(errno));
-                ::close(reserve);
-                UniqueFd dropped(::accept4(listening->get(), nullptr, nullptr, SOCK_CLOEXEC));
-                reserve = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
-                continue;
-            }
             if (errno != EAGAIN && errno != EWOULDBLOCK)
-                ConduitIoThread::log().error("accept on %s: %s", path, std::strerror(errno));
+                outOfResources(owner, listening->get(), errno);
             return;
         }
         auto token = Process::peerOf(peer.get());
         if (!token.ok()) {
-            ConduitIoThread::log().error(
-                "new connection on %s: %s; closing it", path, token.error().localizedDescription());
+            const OMError& error = token.error();
+            // Without its pidfd a peer could not be told from a successor with its pid.
+            if (error.domain() == "POSIX" && isDescriptorShortage(int(error.code()))) {
+                peer.reset();
+                ++turnedAway;
+                outOfResources(owner, listening->get(), int(error.code()));
+                return;
+            }
+            ConduitIoThread::log().error("new connection on %s: %s; closing it", path, error.localizedDescription());
             continue;
         }
+        if (std::exchange(exhausted, false))
+            ConduitIoThread::log().info("accepting connections on %s again; %llu turned away meanwhile", path,
+                static_cast<unsigned long long>(std::exchange(turnedAway, 0)));
         auto connection = ConduitConnection::State::make(
             ConduitConnection::State::Role::Peer, std::move(peer), std::move(token).releaseValue(), std::string());
         ConduitIoThread::shared().addPeer(connection);
         deliver(owner.shared_from_this(), std::move(connection));
     }
+}
+
+// The waiting peers are closed rather than left hanging, and the socket goes unwatched until a
+// descriptor is freed or the back-off passes, so that neither the loop nor the log spins.
+void ConduitListener::State::outOfResources(ConduitListener& owner, int listening, int error)
+{
+    if (!std::exchange(exhausted, true))
+        ConduitIoThread::log().error("accept on %s: %s; turning new connections away until resources are freed", path,
+            OMError::errnoDescription(error));
+    if (isDescriptorShortage(error)) {
+        const TurnedAway result = turnAwayWaitingPeers(listening);
+        turnedAway += result.count;
+        // Still watched, the socket brings the I/O thread back on its next round.
+        if (result.backlogLeft || result.roomAgain)
+            return;
+    }
+    pauseAccepting(owner);
+}
+
+void ConduitListener::State::pauseAccepting(ConduitListener& owner)
+{
+    if (paused)
+        return;
+    paused = true;
+    watchSocket(0);
+    const uint64_t pause = ++pauseCount;
+    std::weak_ptr<ConduitListener> weak = owner.weak_from_this();
+    ConduitIoThread::shared().after(kAcceptBackoff, [weak, pause] {
+        if (auto listener = weak.lock(); listener && listener->m_state->pauseCount == pause)
+            listener->m_state->resumeAccepting();
+    });
+    // One waiter at a time, whatever the number of pauses before a descriptor is freed.
+    if (std::exchange(awaitingDescriptor, true))
+        return;
+    ConduitIoThread::shared().whenDescriptorFreed([weak] {
+        if (auto listener = weak.lock()) {
+            listener->m_state->awaitingDescriptor = false;
+            listener->m_state->resumeAccepting();
+        }
+    });
+}
+
+void ConduitListener::State::resumeAccepting()
+{
+    if (!std::exchange(paused, false))
+        return;
+    restoreSpareDescriptor();
+    // Level-triggered: peers still waiting make the socket readable at once.
+    watchSocket(EPOLLIN);
+}
+
+void ConduitListener::State::watchSocket(uint32_t events)
+{
+    std::lock_guard lock(mutex);
+    if (ioKey != 0 && socket->valid())
+        ConduitIoThread::shared().modify(socket->get(), ioKey, events);
 }
 
 void ConduitListener::State::deliver(

@@ -20,6 +20,8 @@ public:
 
     // "<call>: <strerror>" in the POSIX domain, with errno as the code.
     static OMError fromErrno(std::string_view call, int error);
+    // strerror's text, from any thread.
+    static std::string errnoDescription(int error);
     // For failures of the platform layer itself (decoders, parsers): domain "Platform".
     static OMError platform(int64_t code, std::string description);
 

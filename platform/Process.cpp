@@ -52,6 +52,11 @@ bool stillRunning(const AuditToken& token)
     return result == 0;
 }
 
+bool isDescriptorShortage(int error)
+{
+    return error == EMFILE || error == ENFILE;
+}
+
 OMError goneError(const AuditToken& token)
 {
     return OMError::fromErrno("process " + std::to_string(token.pid), ESRCH);
@@ -91,7 +96,7 @@ SeccompState seccompOf(const std::string& procDirectory)
         else
             (void)std::sscanf(line, "Seccomp_filters: %ld", &state.filters);
     }
-    std::fclose(file);
+    (void)std::fclose(file); // read-only: nothing to lose
     return state;
 }
 
@@ -113,9 +118,14 @@ Result<AuditToken> Process::peerOf(int socketFd)
         token.pidfd = std::make_shared<const UniqueFd>(pidfd);
         return token;
     }
+    // A kernel without pidfds leaves the token without one; a process out of descriptors must not.
+    if (isDescriptorShortage(errno))
+        return OMError::fromErrno("getsockopt(SO_PEERPIDFD)", errno);
     // Older kernels: a pidfd opened now may already name a successor if the peer died and its
     // pid was reused in between; the window is the time since connect, and the best we have.
     UniqueFd opened = pidfdOpen(credentials.pid);
+    if (!opened.valid() && isDescriptorShortage(errno))
+        return OMError::fromErrno("pidfd_open", errno);
     if (opened.valid())
         token.pidfd = std::make_shared<const UniqueFd>(std::move(opened));
     return token;

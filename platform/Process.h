@@ -26,7 +26,8 @@ struct AuditToken {
 
 class Process {
 public:
-    // The peer of a connected Unix socket.
+    // The peer of a connected Unix socket. Fails with EMFILE or ENFILE when the process has no
+    // descriptor left for the pidfd: a peer that cannot be pinned down is not to be served.
     static Result<AuditToken> peerOf(int socketFd);
     // The token of this process (for tests and for the daemon's own identity).
     static AuditToken self();

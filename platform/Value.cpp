@@ -129,7 +129,7 @@ void appendQuoted(std::string& out, std::string_view text)
         default:
             if (static_cast<unsigned char>(c) < 0x20) {
                 char buffer[8];
-                std::snprintf(buffer, sizeof buffer, "\\u%04x", c);
+                (void)std::snprintf(buffer, sizeof buffer, "\\u%04x", c);
                 out += buffer;
             } else {
                 out.push_back(c);
@@ -241,7 +241,7 @@ std::string Value::dateText(double secondsSince1970)
     double fraction = secondsSince1970 - whole;
     if (fraction > 0) {
         char digits[32];
-        std::snprintf(digits, sizeof digits, "%.9f", fraction); // "0.xxxxxxxxx"
+        (void)std::snprintf(digits, sizeof digits, "%.9f", fraction); // "0.xxxxxxxxx"
         std::string tail(digits + 1);
         while (!tail.empty() && tail.back() == '0')
             tail.pop_back();

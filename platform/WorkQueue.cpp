@@ -19,6 +19,18 @@ namespace {
 // through sync(). Nested sync into another queue pushes a second entry.
 thread_local std::vector<const WorkQueue*> t_currentQueues;
 
+// Guards every queue's holder and every thread's wait, so that one thread's check of the chain
+// sees a picture no other thread changes under it. sync() takes it a few times per call; async()
+// and the running of items never do.
+std::mutex& cycleCheckMutex()
+{
+    static std::mutex mutex;
+    return mutex;
+}
+
+// Longer chains than this are not followed: a cycle among other threads is theirs to find.
+constexpr size_t kLongestChain = 256;
+
 // Set by ~WorkQueue when the last reference was dropped on the queue's own thread: what was still
 // queued, to be run by that thread after it has left every member of the dead queue behind.
 thread_local std::optional<std::deque<std::function<void()>>> t_orphanedItems;
@@ -162,28 +174,83 @@ void WorkQueue::async(std::function<void()> work)
     m_wake.notify_one();
 }
 
+struct WorkQueue::Thread {
+    const WorkQueue* waitingFor = nullptr;
+};
+
+WorkQueue::Thread& WorkQueue::currentThread()
+{
+    thread_local Thread thread;
+    return thread;
+}
+
+std::vector<const WorkQueue*> WorkQueue::cycleFromCaller() const
+{
+    const Thread* caller = &currentThread();
+    std::vector<const WorkQueue*> chain { this };
+    for (const WorkQueue* queue = this; chain.size() <= kLongestChain;) {
+        const Thread* holder = queue->m_syncHolder ? queue->m_syncHolder : queue->m_ownThread;
+        if (holder == caller)
+            return chain;
+        if (!holder || !holder->waitingFor)
+            return {};
+        queue = holder->waitingFor;
+        chain.push_back(queue);
+    }
+    return {};
+}
+
+// Aborts naming the queue the caller holds, as for a direct re-entry, and how waiting for this
+// queue would lead back to it.
+void WorkQueue::refuseCycle() const
+{
+    std::vector<const WorkQueue*> chain;
+    {
+        std::lock_guard lock(cycleCheckMutex());
+        chain = cycleFromCaller();
+        if (chain.empty()) {
+            currentThread().waitingFor = this;
+            return;
+        }
+    }
+    std::string through;
+    for (size_t i = 0; i + 1 < chain.size(); ++i)
+        through += (through.empty() ? "" : ", ") + ("\"" + chain[i]->m_label + "\"");
+    internalInconsistency("sync onto work queue \"" + chain.back()->m_label
+        + "\" from code already running on it (through " + through + ")");
+}
+
 void WorkQueue::sync(const std::function<void()>& work)
 {
     if (isCurrent())
         internalInconsistency("sync onto work queue \"" + m_label + "\" from code already running on it");
-
     auto protect = shared_from_this(); // the closure may drop the caller's reference to this queue
+    refuseCycle(); // from here on, the caller is recorded as waiting for this queue
     auto barrier = std::make_shared<SyncBarrier>();
     async([barrier] { barrier->holdQueue(); });
     barrier->waitUntilHeld();
 
     struct Hold {
-        const WorkQueue* queue;
+        WorkQueue* queue;
         SyncBarrier& barrier;
-        Hold(const WorkQueue* q, SyncBarrier& b)
+        Hold(WorkQueue* q, SyncBarrier& b)
             : queue(q)
             , barrier(b)
         {
+            {
+                std::lock_guard lock(cycleCheckMutex());
+                currentThread().waitingFor = nullptr;
+                queue->m_syncHolder = &currentThread();
+            }
             t_currentQueues.push_back(queue);
         }
         ~Hold()
         {
             t_currentQueues.pop_back();
+            {
+                std::lock_guard lock(cycleCheckMutex());
+                queue->m_syncHolder = nullptr;
+            }
             barrier.release();
         }
     } hold(this, *barrier);
@@ -211,6 +278,10 @@ void WorkQueue::run()
 {
     applyThreadAttributes(m_label, m_qos, m_relativePriority);
     t_currentQueues.push_back(this);
+    {
+        std::lock_guard lock(cycleCheckMutex());
+        m_ownThread = &currentThread();
+    }
     for (;;) {
         std::function<void()> item;
         {

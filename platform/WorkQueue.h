@@ -3,8 +3,11 @@
 // sync() runs the closure on the calling thread while holding the queue: it waits until everything
 // queued before it has run, keeps the queue from starting anything else, and marks the queue as
 // current on the calling thread for the duration. Entering a queue synchronously from code already
-// running on it would deadlock, so sync() asserts that the caller is not on the queue; the daemon's
-// lock-order rule is thereby a checked assertion rather than a hope.
+// running on it would deadlock, so sync() asserts that it does not, however indirectly: a queue is
+// held by the thread running its item or by the caller of sync() holding it, and a thread waits in
+// sync() for at most one queue; before it waits, sync() follows "held by a thread that waits for"
+// from the queue it wants, across threads, and aborts when the chain ends at a queue the caller
+// holds. The daemon's lock-order rule is thereby a checked assertion rather than a hope.
 //
 // The quality-of-service class maps to the thread's nice value (user-interactive -10 ... background
 // 10, clamped to what the process may set).
@@ -17,6 +20,7 @@
 #include <mutex>
 #include <string>
 #include <thread>
+#include <vector>
 
 namespace om {
 
@@ -41,8 +45,15 @@ public:
     void assertNotCurrent() const;
 
 private:
+    struct Thread; // what one thread waits for, for the cycle check
+
     WorkQueue(std::string label, QualityOfService qos, int relativePriority);
     void run();
+    static Thread& currentThread();
+    // Under the cycle check's lock: the queues from this one to a queue the calling thread holds,
+    // following holders and what they wait for; empty when the chain ends elsewhere.
+    std::vector<const WorkQueue*> cycleFromCaller() const;
+    void refuseCycle() const;
 
     const std::string m_label;
     const QualityOfService m_qos;
@@ -52,6 +63,10 @@ private:
     std::deque<std::function<void()>> m_items;
     bool m_stopping = false;
     std::thread m_thread;
+    // Guarded by the cycle check's lock. The holder is the caller of sync() while it holds the
+    // queue, else the queue's own thread (which waits for nothing while it is idle).
+    Thread* m_syncHolder = nullptr;
+    Thread* m_ownThread = nullptr;
 };
 
 } // namespace om

@@ -39,6 +39,27 @@ TEST(Format, DecimalPrintsTheTrueValueWhateverTheSignedness)
     EXPECT_EQ(format("%llu", int64_t(0)), "0");
 }
 
+// Every digit in both cases: an off-by-one in mapping digits to upper case shows first at F.
+TEST(Format, HexDigitsInBothCases)
+{
+    struct Case {
+        uint64_t value;
+        const char* lower;
+        const char* upper;
+    };
+    const Case cases[] = {
+        { 0x0123456789abcdefull, "123456789abcdef", "123456789ABCDEF" },
+        { 0xfedcba9876543210ull, "fedcba9876543210", "FEDCBA9876543210" },
+        { 0xf, "f", "F" },
+        { 0xa, "a", "A" },
+        { 0x9, "9", "9" },
+    };
+    for (const auto& c : cases) {
+        EXPECT_EQ(format("%lx", c.value), c.lower);
+        EXPECT_EQ(format("%lX", c.value), c.upper);
+    }
+}
+
 TEST(Format, HexPrintsSixtyFourBitTwosComplement)
 {
     EXPECT_EQ(format("%lx", -1), "ffffffffffffffff");

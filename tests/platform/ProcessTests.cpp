@@ -1,12 +1,15 @@
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <poll.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <climits>
+#include <cstdlib>
 #include <memory>
 
 #include "platform/Process.h"
@@ -85,6 +88,25 @@ TEST(Process, PeerOfSomethingThatIsNotASocketFails)
     auto token = Process::peerOf(a.get());
     ASSERT_FALSE(token.ok());
     EXPECT_NE(token.error().localizedDescription().find("SO_PEERCRED"), std::string::npos);
+}
+
+// Out of descriptors, a peer gets no token without its pidfd: it could not be told apart from a
+// later process with its pid. In a child, whose descriptor table the test fills.
+TEST(ProcessDeathTest, PeerWithoutRoomForItsPidfdIsRefused)
+{
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    auto withEveryDescriptorTaken = [] {
+        int pair[2];
+        if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0)
+            std::_Exit(2);
+        const rlimit tight { 64, 64 };
+        if (::setrlimit(RLIMIT_NOFILE, &tight) != 0)
+            std::_Exit(3);
+        while (::fcntl(pair[0], F_DUPFD_CLOEXEC, 0) >= 0) { }
+        auto token = Process::peerOf(pair[0]);
+        std::_Exit(!token.ok() && token.error().domain() == "POSIX" && token.error().code() == EMFILE ? 0 : 1);
+    };
+    EXPECT_EXIT(withEveryDescriptorTaken(), ::testing::ExitedWithCode(0), "");
 }
 
 TEST(Process, SelfRunsItsOwnExecutableUnsandboxed)

@@ -6,6 +6,9 @@
 
 #include <atomic>
 #include <future>
+#include <mutex>
+#include <ostream>
+#include <string>
 #include <thread>
 #include <vector>
 
@@ -313,6 +316,111 @@ TEST(WorkQueueDeathTest, SyncFromItsOwnItemAborts)
             queue->sync([] {});
         },
         onStderr("com.orvex.test.itemreentry"));
+}
+
+// Queues "chain.a", "chain.b" and "chain.c", and a way into a lock-order cycle through them. Each
+// scenario would hang for ever without the check; with it, whichever thread closes the cycle
+// aborts, naming a queue it already holds.
+struct SyncCycle {
+    const char* name;
+    void (*enter)(WorkQueue& a, WorkQueue& b, WorkQueue& c);
+};
+
+void PrintTo(const SyncCycle& cycle, std::ostream* out)
+{
+    *out << cycle.name;
+}
+
+const SyncCycle kSyncCycles[] = {
+    { "OneThreadThroughThreeQueues",
+        [](WorkQueue& a, WorkQueue& b, WorkQueue& c) {
+            a.sync([&] { b.sync([&] { c.sync([&] { a.sync([] {}); }); }); });
+        } },
+    { "QueueThreadThroughTwoOthers",
+        [](WorkQueue& a, WorkQueue& b, WorkQueue& c) {
+            a.async([&] { b.sync([&] { c.sync([&] { a.sync([] {}); }); }); });
+            a.sync([] {});
+        } },
+    // The caller holds a and waits for b, whose thread is busy with an item that waits for a.
+    { "AcrossTwoThreads",
+        [](WorkQueue& a, WorkQueue& b, WorkQueue&) {
+            a.sync([&] {
+                b.async([&] { a.sync([] {}); });
+                b.sync([] {});
+            });
+        } },
+    // The caller holds a and waits for b; b's thread waits for c; c's thread waits for a.
+    { "AcrossThreeThreads",
+        [](WorkQueue& a, WorkQueue& b, WorkQueue& c) {
+            a.sync([&] {
+                c.async([&] { a.sync([] {}); });
+                b.async([&] { c.sync([] {}); });
+                b.sync([] {});
+            });
+        } },
+};
+
+class WorkQueueSyncCycleDeathTest : public ::testing::TestWithParam<SyncCycle> { };
+
+TEST_P(WorkQueueSyncCycleDeathTest, AbortsNamingAQueueTheCallerHolds)
+{
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    EXPECT_DEATH(
+        {
+            auto a = WorkQueue::create("chain.a");
+            auto b = WorkQueue::create("chain.b");
+            auto c = WorkQueue::create("chain.c");
+            GetParam().enter(*a, *b, *c);
+        },
+        onStderr("sync onto work queue \"chain\\.[abc]\" from code already running on it"));
+}
+
+INSTANTIATE_TEST_SUITE_P(Chains, WorkQueueSyncCycleDeathTest, ::testing::ValuesIn(kSyncCycles),
+    [](const auto& info) { return std::string(info.param.name); });
+
+// The other side of the check: waiting for a queue whose holder waits for nothing of ours, or
+// holding a queue that someone waits for while we wait for nothing of theirs, is no cycle.
+TEST(WorkQueue, SyncWaitsOutHoldersThatWaitForNothingOfOurs)
+{
+    auto a = WorkQueue::create("com.orvex.test.held");
+    auto b = WorkQueue::create("com.orvex.test.busy");
+    std::vector<std::string> events;
+    std::mutex eventsMutex;
+    auto note = [&](std::string event) {
+        std::lock_guard lock(eventsMutex);
+        events.push_back(std::move(event));
+    };
+
+    // b's thread is busy with an item that waits on something that is no queue, while this thread
+    // holds a and waits for b.
+    std::promise<void> itemStarted;
+    std::promise<void> releaseItem;
+    b->async([&, released = releaseItem.get_future().share()] {
+        itemStarted.set_value();
+        released.wait();
+        note("b's item done");
+    });
+    itemStarted.get_future().wait();
+    a->sync([&] {
+        releaseItem.set_value();
+        b->sync([&] { note("caller holds a and b"); });
+    });
+
+    // b's item waits for a, which this thread holds while it waits for nothing of b's.
+    std::promise<void> itemWaitsForA;
+    a->sync([&] {
+        b->async([&] {
+            itemWaitsForA.set_value();
+            a->sync([&] { note("b's item holds a"); });
+        });
+        itemWaitsForA.get_future().wait();
+        note("caller lets a go");
+    });
+    b->sync([] {});
+
+    const std::vector<std::string> expected
+        = { "b's item done", "caller holds a and b", "caller lets a go", "b's item holds a" };
+    EXPECT_EQ(events, expected);
 }
 
 TEST(WorkQueueDeathTest, AssertCurrentOffTheQueueAborts)

@@ -7,6 +7,7 @@
 #include <sys/inotify.h>
 #include <sys/prctl.h>
 #include <sys/ptrace.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
@@ -72,6 +73,7 @@ struct LaunchPlan {
     std::vector<char*> envp;
     int nullFd = -1;
     int stderrFd = -1;
+    std::optional<rlimit> descriptorLimit;
 
     void seal()
     {
@@ -96,6 +98,8 @@ struct LaunchPlan {
     (void)::sigprocmask(SIG_SETMASK, &none, nullptr);
     ::signal(SIGPIPE, SIG_DFL);
     ::signal(SIGTERM, SIG_DFL);
+    if (plan.descriptorLimit && ::setrlimit(RLIMIT_NOFILE, &*plan.descriptorLimit) != 0)
+        ::_exit(127);
     ::execve(plan.path.c_str(), plan.argv.data(), plan.envp.data());
     ::_exit(127);
 }
@@ -209,6 +213,8 @@ DaemonProcess::DaemonProcess(Options options)
     }
     plan.argumentStorage.insert(plan.argumentStorage.end(), options.arguments.begin(), options.arguments.end());
     plan.environmentStorage = environmentFor(options, m_root, m_conduitDirectory);
+    if (options.descriptorLimit)
+        plan.descriptorLimit = rlimit { rlim_t(*options.descriptorLimit), rlim_t(*options.descriptorLimit) };
     plan.seal();
 
     UniqueFd null(::open("/dev/null", O_RDWR | O_CLOEXEC));
@@ -353,6 +359,39 @@ bool DaemonProcess::waitForStderrClosed(std::chrono::milliseconds timeout)
 {
     std::unique_lock lock(m_mutex);
     return m_changed.wait_for(lock, timeout, [&] { return m_stderrClosed; });
+}
+
+std::optional<uint64_t> DaemonProcess::cpuTicks() const
+{
+    std::ifstream file("/proc/" + std::to_string(m_pid) + "/stat");
+    std::string stat;
+    if (!std::getline(file, stat))
+        return std::nullopt;
+    // The command name may hold spaces and parentheses: the fields start after the last ')'.
+    // From there, utime and stime are the 12th and 13th.
+    std::istringstream fields(stat.substr(stat.rfind(')') + 1));
+    std::string field;
+    uint64_t user = 0, system = 0;
+    for (int index = 1; index <= 13 && fields >> field; ++index) {
+        if (index == 12)
+            user = std::stoull(field);
+        if (index == 13)
+            system = std::stoull(field);
+    }
+    if (!fields)
+        return std::nullopt;
+    return user + system;
+}
+
+std::optional<uint64_t> DaemonProcess::residentBytes() const
+{
+    std::ifstream file("/proc/" + std::to_string(m_pid) + "/status");
+    std::string line;
+    while (std::getline(file, line)) {
+        if (line.starts_with("VmRSS:"))
+            return std::stoull(line.substr(6)) * 1024;
+    }
+    return std::nullopt;
 }
 
 void DaemonProcess::sendSignal(int signal)

@@ -8,6 +8,7 @@
 
 #include <chrono>
 #include <condition_variable>
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <mutex>
@@ -53,6 +54,8 @@ public:
         // Puts "-d <root>/annotations.vlist" ahead of the arguments, so that the daemon's
         // annotation database is private too (a "-d" among the arguments still wins).
         bool privateDatabase = true;
+        // RLIMIT_NOFILE, soft and hard alike, so that the daemon cannot raise it.
+        std::optional<uint64_t> descriptorLimit;
     };
 
     // Starts the process. A binary that cannot be started exits with status 127.
@@ -87,6 +90,11 @@ public:
         std::chrono::milliseconds timeout = kDaemonTimeout);
     // Blocks until the process has closed standard error (usually: it has exited).
     bool waitForStderrClosed(std::chrono::milliseconds timeout = kDaemonTimeout);
+
+    // User plus system CPU time the process has used, in clock ticks (/proc/<pid>/stat).
+    std::optional<uint64_t> cpuTicks() const;
+    // Its resident memory (VmRSS) in bytes.
+    std::optional<uint64_t> residentBytes() const;
 
     void sendSignal(int signal);
     // Sends SIGTERM and waits for the exit. The wait status, or none when it did not end in time.

@@ -149,7 +149,7 @@ int OmctlDiagnostics::ping(OmctlContext& context, const std::vector<std::string>
         times.append(Value::real(elapsed.count()));
         if (!context.json()) {
             char line[64];
-            std::snprintf(line, sizeof line, "%.3f ms", elapsed.count());
+            (void)std::snprintf(line, sizeof line, "%.3f ms", elapsed.count());
             context.out() << "omd at " << context.socketPath() << " is answering (round trip " << line << ")\n";
         }
     }
