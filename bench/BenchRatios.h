@@ -17,8 +17,11 @@ public:
     void ReportRuns(const std::vector<Run>& runs) override
     {
         for (const auto& run : runs) {
-            if (run.run_type == Run::RT_Iteration && run.iterations > 0)
+            if (run.run_type == Run::RT_Iteration && run.iterations > 0) {
                 m_seconds[run.run_name.str()].push_back(run.cpu_accumulated_time / static_cast<double>(run.iterations));
+                m_realSeconds[run.run_name.str()].push_back(
+                    run.real_accumulated_time / static_cast<double>(run.iterations));
+            }
             else if (run.run_type == Run::RT_Aggregate && run.aggregate_name == "median")
                 m_medians[run.run_name.str()] = run.GetAdjustedCPUTime() * 1e-9; // aggregates only
         }
@@ -33,6 +36,18 @@ public:
 
 protected:
     virtual void printRatios() = 0;
+
+    // Wall-clock seconds per operation, median of the repetitions: for work that waits (on the
+    // disk, on another process) rather than computes. 0 when it did not run.
+    double realMedian(const std::string& name)
+    {
+        auto it = m_realSeconds.find(name);
+        if (it == m_realSeconds.end())
+            return 0;
+        auto& samples = it->second;
+        std::sort(samples.begin(), samples.end());
+        return samples[samples.size() / 2];
+    }
 
     // CPU seconds per operation of the named benchmark, median of its repetitions; 0 when it did
     // not run.
@@ -50,6 +65,7 @@ protected:
 
 private:
     std::map<std::string, std::vector<double>> m_seconds;
+    std::map<std::string, std::vector<double>> m_realSeconds;
     std::map<std::string, double> m_medians; // when only aggregates were reported
 };
 

@@ -19,6 +19,7 @@
 #include <fstream>
 #include <map>
 
+#include "bench/BenchPopulation.h"
 #include "bench/BenchRatios.h"
 #include "platform/Registrar.h"
 #include "platform/RegistrarBundleReader.h"
@@ -31,17 +32,7 @@ namespace fs = std::filesystem;
 
 constexpr size_t kSmall = 100;
 constexpr size_t kLarge = 100'000;
-constexpr size_t kPerExtensionPoint = 10; // what one query selects
-constexpr size_t kBatch = 10'000;
-
-std::string fastTemporaryDirectory()
-{
-    for (const char* candidate : { "/dev/shm", static_cast<const char*>(std::getenv("TMPDIR")), "/tmp" }) {
-        if (candidate && *candidate && ::access(candidate, W_OK) == 0)
-            return candidate;
-    }
-    return ".";
-}
+constexpr size_t kPerExtensionPoint = BenchPopulation::kPerExtensionPoint;
 
 size_t residentBytes()
 {
@@ -66,77 +57,24 @@ struct Footprint {
 };
 Footprint g_footprint;
 
-// count plug-ins, kPerExtensionPoint to each extension point, registered in a workspace of their own.
-class Population {
+// The population of benchmarks with count plug-ins, with the memory its registration took.
+class Population : public BenchPopulation {
 public:
     explicit Population(size_t count)
+        : BenchPopulation(count)
     {
-        std::string pattern = fastTemporaryDirectory() + "/om-bench-registrar.XXXXXX";
-        if (!::mkdtemp(pattern.data()))
-            std::abort();
-        m_root = pattern;
-        std::vector<std::string> paths;
-        size_t declared = 0;
-        for (size_t i = 0; i < count; ++i) {
-            std::string identifier = "com.orvex.bench.plugin" + std::to_string(i);
-            Value info = Value::dictionary({
-                { "VBBundleIdentifier", Value(identifier) },
-                { "VBBundleVersion", "1" },
-                { "VBBundleShortVersionString", "1.0" },
-                { "VBBundleName", Value("Plug-in " + std::to_string(i)) },
-                { "QSExtension",
-                    Value::dictionary({ { "QSExtensionPointIdentifier", Value(pointOf(i)) },
-                        { "QSExtensionAttributes",
-                            Value::dictionary(
-                                { { "QSExtensionActivationRule", Value::dictionary({ { "text/plain", 1 } }) } }) } }) },
-            });
-            std::string path = m_root + "/bundles/" + std::to_string(i % 1000) + "/" + identifier + ".appex";
-            fs::create_directories(path);
-            std::string text = Vlist::writeXml(info);
-            declared += text.size();
-            std::ofstream(path + "/Info.vlist") << text;
-            paths.push_back(path);
-        }
-
-        RegistrarWorkspace::Configuration configuration { .databasePath = m_root + "/registrar.db",
-            .sdkDirectory = m_root + "/sdk",
-            .containersDirectory = m_root + "/containers" };
-        auto opened = RegistrarWorkspace::open(configuration, RegistrarWorkspace::Access::ReadWrite);
-        if (!opened.ok())
-            std::abort();
-        m_workspace = opened.value();
-
         ::malloc_trim(0);
         const size_t residentBefore = residentBytes();
         const size_t heapBefore = heapInUse();
-        for (size_t start = 0; start < paths.size(); start += kBatch) {
-            std::vector<std::string> batch(
-                paths.begin() + long(start), paths.begin() + long(std::min(paths.size(), start + kBatch)));
-            for (auto& result : m_workspace->registerPlugIns(batch)) {
-                if (!result.ok())
-                    std::abort();
-                m_uuids.push_back(result.value()->uuid());
-            }
-        }
-        m_workspace->waitForNotifications();
+        registerAll();
         ::malloc_trim(0);
-        if (count == kLarge) {
-            g_footprint.residentPerPlugIn = double(residentBytes() - residentBefore) / double(count);
-            g_footprint.heapPerPlugIn = double(heapInUse() - heapBefore) / double(count);
-            g_footprint.declaredPerPlugIn = double(declared) / double(count);
-        }
-        m_paths = std::move(paths);
-        if (count == kLarge) {
-            g_footprint.dictionariesPerPlugIn = dictionaryBytes() / double(count);
-            g_footprint.reopenedPerPlugIn = reopenedBytes(configuration) / double(count);
-        }
-    }
-
-    ~Population()
-    {
-        m_workspace.reset();
-        std::error_code ignored;
-        fs::remove_all(m_root, ignored);
+        if (count != kLarge)
+            return;
+        g_footprint.residentPerPlugIn = double(residentBytes() - residentBefore) / double(count);
+        g_footprint.heapPerPlugIn = double(heapInUse() - heapBefore) / double(count);
+        g_footprint.declaredPerPlugIn = double(declaredBytes()) / double(count);
+        g_footprint.dictionariesPerPlugIn = dictionaryBytes() / double(count);
+        g_footprint.reopenedPerPlugIn = reopenedBytes(configuration()) / double(count);
     }
 
     // The heap of a second workspace opened on the same database: what a restarted daemon holds.
@@ -156,9 +94,9 @@ public:
     double dictionaryBytes() const
     {
         std::vector<Value> kept;
-        kept.reserve(m_paths.size() * 2); // the vector itself is not counted
+        kept.reserve(paths().size() * 2); // the vector itself is not counted
         const size_t before = heapInUse();
-        for (const std::string& path : m_paths) {
+        for (const std::string& path : paths()) {
             auto info = RegistrarBundleReader::readInfo(path);
             auto facts = RegistrarBundleReader::plugInFacts(path, info.value(), Value(), {});
             kept.push_back(facts->infoDictionary);
@@ -167,17 +105,6 @@ public:
         return double(heapInUse() - before);
     }
 
-    static std::string pointOf(size_t i) { return "com.orvex.bench.point" + std::to_string(i / kPerExtensionPoint); }
-
-    RegistrarWorkspace& workspace() { return *m_workspace; }
-    const std::vector<Uuid>& uuids() const { return m_uuids; }
-    const std::vector<std::string>& paths() const { return m_paths; }
-
-private:
-    std::string m_root;
-    std::shared_ptr<RegistrarWorkspace> m_workspace;
-    std::vector<Uuid> m_uuids;
-    std::vector<std::string> m_paths;
 };
 
 Population& population(size_t count)
@@ -219,13 +146,13 @@ void lookUpEach(benchmark::State& state, const std::vector<Key>& keys, const Loo
 void lookupByUuid(benchmark::State& state)
 {
     Population& plugIns = population(size_t(state.range(0)));
-    lookUpEach(state, plugIns.uuids(), [&](const Uuid& uuid) { return plugIns.workspace().plugInWithUuid(uuid); });
+    lookUpEach(state, plugIns.uuids(), [&](const Uuid& uuid) { return plugIns.workspace()->plugInWithUuid(uuid); });
 }
 
 void lookupByPath(benchmark::State& state)
 {
     Population& plugIns = population(size_t(state.range(0)));
-    lookUpEach(state, plugIns.paths(), [&](const std::string& path) { return plugIns.workspace().plugInAtPath(path); });
+    lookUpEach(state, plugIns.paths(), [&](const std::string& path) { return plugIns.workspace()->plugInAtPath(path); });
 }
 
 void queryByExtensionPoint(benchmark::State& state)
@@ -239,7 +166,7 @@ void queryByExtensionPoint(benchmark::State& state)
     const RegistrarWorkspace::CandidateFilter keepAll = [](const std::string&, const Value&) { return true; };
     size_t index = 0;
     for (auto _ : state) {
-        auto selected = plugIns.workspace().query(rules[index], keepAll);
+        auto selected = plugIns.workspace()->query(rules[index], keepAll);
         if (selected.size() != kPerExtensionPoint)
             state.SkipWithError("the query did not select 10 plug-ins");
         benchmark::DoNotOptimize(selected);

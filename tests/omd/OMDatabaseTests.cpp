@@ -212,8 +212,9 @@ TEST_F(UuidListWalk, RefusesBadListsAndWalksGoodOnesInOrder)
         } else {
             EXPECT_EQ(*reply, Value::dictionary({})) << test.name;
         }
-        if (test.handled == 2)
+        if (test.handled == 2) {
             EXPECT_EQ(handled, (std::vector<Uuid> { known[1], known[0] }));
+        }
     }
 }
 
