@@ -23,10 +23,15 @@ public:
     static constexpr size_t kApplications = 1000;
     static constexpr size_t kBatch = 10'000;
 
+    // Where the population lives: memory (fast, where fsync costs nothing) or the disk that
+    // temporary files go to (where durability costs what it costs).
+    enum class Medium : uint8_t { Memory, Disk };
+
     // Makes the bundles and opens the workspace; registerAll() registers them.
-    explicit BenchPopulation(size_t count)
+    explicit BenchPopulation(size_t count, Medium medium = Medium::Memory)
     {
-        std::string pattern = fastTemporaryDirectory() + "/om-bench-population.XXXXXX";
+        std::string pattern = (medium == Medium::Memory ? fastTemporaryDirectory() : diskTemporaryDirectory())
+            + "/om-bench-population.XXXXXX";
         if (!::mkdtemp(pattern.data()))
             std::abort();
         m_root = pattern;
@@ -76,6 +81,12 @@ public:
                 return candidate;
         }
         return ".";
+    }
+
+    static std::string diskTemporaryDirectory()
+    {
+        const char* tmp = std::getenv("TMPDIR");
+        return tmp && *tmp ? tmp : "/tmp";
     }
 
     const std::string& root() const { return m_root; }
