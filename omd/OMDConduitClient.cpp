@@ -135,6 +135,12 @@ bool OMDConduitClient::entitlementHeld(const Value& value)
     return !value.isNone() && value != Value::boolean(false);
 }
 
+bool OMDConduitClient::isSandboxed() const
+{
+    auto connection = m_connection.lock();
+    return connection && Process::isSandboxed(connection->auditToken());
+}
+
 std::string OMDConduitClient::description() const
 {
     auto connection = m_connection.lock();

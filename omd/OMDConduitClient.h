@@ -43,6 +43,8 @@ public:
     // The rule hasEntitlement applies to an entitlement's value.
     static bool entitlementHeld(const Value& value);
     std::string description() const;
+    // Whether the peer runs in a sandbox (another user or mount namespace, or a seccomp filter).
+    bool isSandboxed() const;
 
     std::shared_ptr<ConduitConnection> connection() const { return m_connection.lock(); }
     const std::shared_ptr<OMDServer>& server() const { return m_server; }

@@ -7,7 +7,9 @@
 #include "Ombrel/OMBundle.h"
 #include "Ombrel/OMLog.h"
 #include "Ombrel/OMMakeError.h"
+#include "Ombrel/OMMatcher.h"
 #include "Ombrel/OMSandboxExtension.h"
+#include "omd/OMDServer.h"
 
 namespace om {
 
@@ -42,8 +44,8 @@ uint32_t hubProtocolVersionOf(const Value& declared, bool oldStyle)
 }
 
 // A display name read once from the Registrar and kept; asked again while the Registrar has none.
-std::optional<std::string> lazily(std::mutex& mutex, std::optional<std::string>& field,
-    const std::function<std::optional<std::string>()>& fill)
+std::optional<std::string> lazily(
+    std::mutex& mutex, std::optional<std::string>& field, const std::function<std::optional<std::string>()>& fill)
 {
     {
         std::lock_guard lock(mutex);
@@ -176,6 +178,45 @@ Value OMDPlugIn::prunedInfoDictionaryFor(const Value& info)
             kept.push_back(entry);
     }
     return Value::dictionary(std::move(kept));
+}
+
+namespace {
+
+// Elections come from the server's annotation store; a process without a server has none.
+const OMMatcher& matcher()
+{
+    static const OMMatcher shared([](const OMPlugInCore& plugIn) {
+        auto server = OMDServer::server();
+        return server ? server->annotationForPlugIn(static_cast<const OMDPlugIn&>(plugIn)) : Value();
+    });
+    return shared;
+}
+
+} // namespace
+
+bool OMDPlugIn::match(const Value& rules) const
+{
+    return matcher().match(*this, rules);
+}
+
+bool OMDPlugIn::matchKey(std::string_view key, const Value& pattern) const
+{
+    return matcher().matchKey(*this, key, pattern);
+}
+
+bool OMDPlugIn::matchValuePatterns(const std::string& value, const Value& patterns)
+{
+    return OMMatcher::matchValuePatterns(value, patterns);
+}
+
+bool OMDPlugIn::matchValuePattern(const std::string& value, std::string_view pattern)
+{
+    return OMMatcher::matchValuePattern(value, pattern);
+}
+
+bool OMDPlugIn::matchDictionaryPattern(const Value& value, const Value& pattern)
+{
+    return OMMatcher::matchDictionaryPattern(value, pattern);
 }
 
 void OMDPlugIn::augmentForm(DictionaryBuilder& form) const

@@ -3,8 +3,8 @@
 // display names from it, so the daemon never reads a plug-in's bundle itself.
 //
 // The source is split by concern: OMDPlugIn.cpp (construction, lookups, entitlements, checks,
-// the form's resource tokens); the matching, access and readying operations join it in files of
-// their own.
+// the form's resource tokens, matching through OMMatcher with the user's elections) and
+// OMDPlugInAccess.cpp (which hosts may use it).
 #pragma once
 
 #include <memory>
@@ -16,6 +16,8 @@
 #include "platform/Registrar.h"
 
 namespace om {
+
+class OMDConduitClient;
 
 class OMDPlugIn final : public OMPlugInCore {
 public:
@@ -52,6 +54,16 @@ public:
     std::optional<OMError> diagnose() const override;
     // A copy of info without the keys beginning "DT" (build facts).
     static Value prunedInfoDictionaryFor(const Value& info);
+
+    // Attribute matching (OMMatcher), with elections read through the server's annotations.
+    bool match(const Value& rules) const;
+    bool matchKey(std::string_view key, const Value& pattern) const;
+    static bool matchValuePatterns(const std::string& value, const Value& patterns);
+    static bool matchValuePattern(const std::string& value, std::string_view pattern);
+    static bool matchDictionaryPattern(const Value& value, const Value& pattern);
+
+    // None when the host may use the plug-in; otherwise why not.
+    std::optional<std::string> allowForClient(const OMDConduitClient& client) const;
 
     // Adds "extensions": a token for each resource the plug-in shares ("." alone for an app
     // extension), when it shares any.

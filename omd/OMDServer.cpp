@@ -1,9 +1,11 @@
 #include "omd/OMDServer.h"
 
+#include <algorithm>
 #include <mutex>
 
 #include "Ombrel/OMLog.h"
 #include "omd/OMDConduitClient.h"
+#include "omd/OMDPlugInHold.h"
 #include "platform/RunLoop.h"
 
 namespace om {
@@ -75,6 +77,7 @@ std::shared_ptr<OMDServer> OMDServer::initForService(
         if (auto strongServer = weakServer.lock())
             strongServer->acceptConnection(std::move(connection));
     });
+    server->m_userPrefs = std::make_unique<OMDUserPrefs>();
     return server;
 }
 
@@ -117,6 +120,15 @@ void OMDServer::removedPlugIns(const RegistrarPlugInRecords& records)
     // FIXME: stop the plug-ins' running instances (terminatePlugIns) and log from its completion,
     // once holds and the job manager are in the tree. Until then there is nothing to wait for.
     OMLog::ops().debug("removal complete for %@", describeRecords(records));
+}
+
+bool OMDServer::holdOnPlugIn(const std::shared_ptr<OMDPlugIn>& plugIn)
+{
+    bool held = false;
+    m_syncQueue->sync([&] {
+        held = std::any_of(m_holds.begin(), m_holds.end(), [&](const auto& hold) { return hold->blocks(plugIn); });
+    });
+    return held;
 }
 
 void OMDServer::unholdClient(const OMDConduitClient&)

@@ -8,6 +8,7 @@
 #include <string>
 #include <vector>
 
+#include "omd/OMDUserPrefs.h"
 #include "omd/OMDatabase.h"
 #include "omd/OMDatabaseDelegate.h"
 #include "platform/Conduit.h"
@@ -16,6 +17,7 @@
 namespace om {
 
 class OMDConduitClient;
+class OMDPlugIn;
 class OMDPlugInHold;
 
 class OMDServer final : public OMDatabase, public OMDatabaseDelegate {
@@ -42,6 +44,8 @@ public:
     void submitWork(std::function<void()> work);
 
     void removedPlugIns(const RegistrarPlugInRecords& records) override;
+    // True when a live hold blocks the plug-in. Enters "serverSync".
+    bool holdOnPlugIn(const std::shared_ptr<OMDPlugIn>& plugIn);
     // Releases every hold whose client is this very record. Called when its connection dies.
     void unholdClient(const OMDConduitClient& client);
 
@@ -49,6 +53,7 @@ public:
     const std::shared_ptr<WorkQueue>& mainQueue() const { return m_mainQueue; }
     const std::shared_ptr<WorkQueue>& syncQueue() const { return m_syncQueue; }
     const std::shared_ptr<ConduitListener>& service() const { return m_service; }
+    OMDUserPrefs& userPrefs() { return *m_userPrefs; }
 
 private:
     explicit OMDServer(std::optional<std::string> databasePath);
@@ -57,7 +62,8 @@ private:
     std::shared_ptr<WorkQueue> m_conduitQueue;
     std::shared_ptr<WorkQueue> m_mainQueue;
     std::shared_ptr<ConduitListener> m_service;
-    // The user-preferences object (the user's plug-in exclusions) joins these with the access rules.
+    // The user's preference domain: the plug-in exclusions.
+    std::unique_ptr<OMDUserPrefs> m_userPrefs;
     // Live holds in the order they were granted; touched only on m_syncQueue. Empty until the
     // "lock" request exists.
     std::vector<std::shared_ptr<OMDPlugInHold>> m_holds;
