@@ -3,6 +3,7 @@
 #include "Ombrel/OMBundle.h"
 #include "Ombrel/OMLog.h"
 #include "Ombrel/OMMakeError.h"
+#include "omd/OMDAnnotationStore.h"
 #include "omd/OMDPlugIn.h"
 
 namespace om {
@@ -55,6 +56,7 @@ Result<void> OMDatabase::openDatabase()
         return workspace.error();
     }
     m_workspace = std::move(workspace).releaseValue();
+    m_annotations = OMDAnnotationStore::initWithDatabase(m_databasePath);
     m_workspace->addObserver(std::static_pointer_cast<RegistrarObserver>(shared_from_this()));
     return {};
 }
@@ -87,8 +89,14 @@ std::shared_ptr<OMDPlugIn> OMDatabase::createPlugInForProxy(const std::shared_pt
     if (plugIn->hasEntitlement(kAutoElectEntitlement))
         autoElect(plugIn);
     purgeCachesToLimit(m_cacheLimit);
-    m_cache[plugIn->registrationUuid()] = plugIn;
+    cache(plugIn);
     return plugIn;
+}
+
+void OMDatabase::cache(const std::shared_ptr<OMDPlugIn>& plugIn)
+{
+    m_cache[plugIn->registrationUuid()] = plugIn;
+    m_cachedCount.store(m_cache.size(), std::memory_order_relaxed);
 }
 
 void OMDatabase::purgeCachesToLimit(uint32_t limit)
@@ -97,6 +105,7 @@ void OMDatabase::purgeCachesToLimit(uint32_t limit)
         return;
     OMLog::ops().info("purging cache for %d > %d", static_cast<int>(m_cache.size()), static_cast<int>(limit));
     m_cache.clear();
+    m_cachedCount.store(0, std::memory_order_relaxed);
     m_workspace->dropCaches();
 }
 
@@ -174,17 +183,11 @@ void OMDatabase::pluginsWillUninstall(const RegistrarPlugInRecords& records)
             logChange("plug-in UNINSTALLED:%@ %@(%@) %{public}@ %@", *record);
             m_cache.erase(record->uuid());
         }
+        m_cachedCount.store(m_cache.size(), std::memory_order_relaxed);
     });
     // Outside _sync: the delegate stops running instances, which may take its own locks.
     if (auto delegate = this->delegate())
         delegate->removedPlugIns(records);
-}
-
-void OMDatabase::autoElect(const std::shared_ptr<OMDPlugIn>&)
-{
-    _sync->assertCurrent();
-    // FIXME: store {"election": 1} for the plug-in's annotation key, unless the user's election is
-    // already non-zero, once the annotation store is in the tree.
 }
 
 } // namespace om

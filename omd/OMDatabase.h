@@ -7,6 +7,7 @@
 // runs there may enter it synchronously again.
 #pragma once
 
+#include <atomic>
 #include <cstdint>
 #include <memory>
 #include <optional>
@@ -24,8 +25,12 @@
 
 namespace om {
 
+class OMDAnnotationStore;
 class OMDPlugIn;
 using OMDPlugIns = std::vector<std::shared_ptr<OMDPlugIn>>;
+
+// Posted when annotations or holds change, so that hosts run discovery again.
+inline constexpr const char* kAnnotationChangeNotification = "com.orvex.ombrel.annotation-change";
 
 class OMDatabase : public std::enable_shared_from_this<OMDatabase>, public RegistrarObserver {
 public:
@@ -43,6 +48,7 @@ public:
     uint32_t cacheLimit() const { return m_cacheLimit; }
     void setCacheLimit(uint32_t limit) { m_cacheLimit = limit; }
     const std::shared_ptr<RegistrarWorkspace>& workspace() const { return m_workspace; }
+    const std::shared_ptr<OMDAnnotationStore>& annotations() const { return m_annotations; }
 
     const std::optional<std::string>& databasePath() const { return m_databasePath; }
     // Number of cached records; enters _sync, so never call it from there.
@@ -65,6 +71,19 @@ public:
     std::optional<OMError> addPlugIn(std::string_view url);
     std::optional<OMError> removePlugIn(std::string_view url);
 
+    // The discovery query's candidates for a host's rules (OMDatabaseDiscovery.cpp): the
+    // Registrar's records, narrowed by its indexes and by the election prefilter, as cached
+    // records. None when the Registrar returned nothing.
+    std::optional<OMDPlugIns> findPlugIns(const Value& rules);
+    // The election texts a rules dictionary's "QSUserElection" pushes into the Registrar's query;
+    // none when it cannot be pushed down.
+    static std::optional<std::vector<std::string>> electionPrefilter(const Value& rules);
+
+    // The annotation entry points (OMDatabaseAnnotations.cpp); they enter _sync.
+    Value annotationForPlugIn(const OMDPlugIn& plugIn) const;
+    void setAnnotation(const Value& annotation, const OMDPlugIn& plugIn);
+    void notifyAnnotationChange();
+
     // The Registrar's notifications, on its notification thread.
     void pluginsDidInstall(const RegistrarPlugInRecords& records) override;
     void pluginsWillUninstall(const RegistrarPlugInRecords& records) override;
@@ -75,17 +94,27 @@ public:
 protected:
     explicit OMDatabase(std::optional<std::string> databasePath);
     // The fallible half of construction, run once the object is owned by a shared_ptr (observer
-    // registration needs a weak reference to it): opens the Registrar and observes it.
+    // registration needs a weak reference to it): opens the Registrar and the annotation store,
+    // and observes the Registrar.
     Result<void> openDatabase();
+    // Stores a record in the cache; on _sync.
+    void cache(const std::shared_ptr<OMDPlugIn>& plugIn);
 
     // Read and changed only on _sync.
     std::unordered_map<Uuid, std::shared_ptr<OMDPlugIn>> m_cache;
     const std::shared_ptr<WorkQueue> _sync;
 
 private:
+    bool passesPrefilter(
+        const std::vector<std::string>& prefilter, const std::string& identifier, const Value& entitlements) const;
+    static Value describe(const RegistrarPlugInRecords& records);
+
     std::weak_ptr<OMDatabaseDelegate> m_delegate;
     uint32_t m_cacheLimit = 0;
     std::shared_ptr<RegistrarWorkspace> m_workspace;
+    std::shared_ptr<OMDAnnotationStore> m_annotations;
+    // The cache's size for log lines written off _sync.
+    std::atomic<size_t> m_cachedCount { 0 };
     const std::optional<std::string> m_databasePath;
 };
 
