@@ -69,6 +69,9 @@ public:
     // ends the request on success.
     bool processUuidList(const PlugInHandler& handler);
 
+    // Sets the form's "annotations" to the plug-in's stored annotation, or an empty dictionary.
+    void addAnnotationForPlugIn(const OMDPlugIn& plugIn, DictionaryBuilder& form);
+
     const std::shared_ptr<OMDServer>& server() const;
     // Null once the peer's connection object is gone.
     std::shared_ptr<ConduitConnection> connection() const;
@@ -76,6 +79,9 @@ public:
 private:
     // Runs the handler named by the request, or answers that there is none (TransactionDispatch.cpp).
     void runHandler(const std::string& name);
+
+    // Discovery's visibility rules for this client (TransactionMatch.cpp).
+    bool visibleToClient(const std::shared_ptr<OMDPlugIn>& plugIn, uint64_t flags) const;
 
     // Request handlers, one per row of the dispatch table. Each finishes with done() or fail().
     void addPlugIns();
