@@ -146,6 +146,7 @@ public:
             "CONSENT_DB=" + root + "/consent.db",
             "PREFS_DIR=" + root + "/prefs",
             "SANDBOX_KEY=" + root + "/sandbox.key",
+            "OMD_GLOBAL_ANNOTATIONS=" + root + "/global-annotations",
         };
         settings.insert(settings.end(), extraSettings.begin(), extraSettings.end());
         for (char** entry = environ; *entry; ++entry) {

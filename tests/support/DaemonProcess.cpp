@@ -119,6 +119,7 @@ std::vector<std::string> environmentFor(
         { "CONSENT_DB", root + "/consent.db" },
         { "PREFS_DIR", root + "/prefs" },
         { "SANDBOX_KEY", root + "/sandbox.key" },
+        { "OMD_GLOBAL_ANNOTATIONS", root + "/global-annotations" },
     };
     // The log lines are read from standard error, so they must not go to a journal instead.
     settings.emplace_back("EVLOG_STDERR", "1");
