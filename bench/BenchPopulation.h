@@ -109,8 +109,7 @@ private:
             { "VBBundleShortVersionString", "1.0" },
             { "VBBundleName", Value("Plug-in " + identifier) },
             { "QSExtension",
-                Value::dictionary({ { "QSExtensionPointIdentifier", Value(point) },
-                    { "QSExtensionProtocol", "#Data" },
+                Value::dictionary({ { "QSExtensionPointIdentifier", Value(point) }, { "QSExtensionProtocol", "#Data" },
                     { "QSExtensionAttributes",
                         Value::dictionary(
                             { { "QSExtensionActivationRule", Value::dictionary({ { "text/plain", 1 } }) } }) } }) },

@@ -21,8 +21,7 @@ public:
                 m_seconds[run.run_name.str()].push_back(run.cpu_accumulated_time / static_cast<double>(run.iterations));
                 m_realSeconds[run.run_name.str()].push_back(
                     run.real_accumulated_time / static_cast<double>(run.iterations));
-            }
-            else if (run.run_type == Run::RT_Aggregate && run.aggregate_name == "median")
+            } else if (run.run_type == Run::RT_Aggregate && run.aggregate_name == "median")
                 m_medians[run.run_name.str()] = run.GetAdjustedCPUTime() * 1e-9; // aggregates only
         }
         ConsoleReporter::ReportRuns(runs);

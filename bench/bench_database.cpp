@@ -7,7 +7,6 @@
 // registered plug-in costs a running daemon.
 #include <benchmark/benchmark.h>
 #include <malloc.h>
-#include <sqlite3.h>
 #include <unistd.h>
 
 #include <cstdio>
@@ -20,6 +19,8 @@
 #include "omd/OMDPlugIn.h"
 #include "omd/OMDatabase.h"
 #include "platform/Vlist.h"
+
+#include <sqlite3.h>
 
 namespace om::bench {
 namespace {
@@ -126,8 +127,9 @@ void sqliteInsert(benchmark::State& state)
     sqlite3* db = nullptr;
     if (sqlite3_open((bundles.root() + "/bare.db").c_str(), &db) != SQLITE_OK)
         std::abort();
-    sqlite3_exec(db, "PRAGMA journal_mode=WAL; PRAGMA synchronous=FULL;"
-                     "CREATE TABLE plugins(uuid BLOB PRIMARY KEY, path TEXT UNIQUE, info BLOB)",
+    sqlite3_exec(db,
+        "PRAGMA journal_mode=WAL; PRAGMA synchronous=FULL;"
+        "CREATE TABLE plugins(uuid BLOB PRIMARY KEY, path TEXT UNIQUE, info BLOB)",
         nullptr, nullptr, nullptr);
     sqlite3_stmt* insert = nullptr;
     sqlite3_prepare_v2(db, "INSERT INTO plugins VALUES(?, ?, ?)", -1, &insert, nullptr);

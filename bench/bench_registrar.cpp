@@ -104,7 +104,6 @@ public:
         }
         return double(heapInUse() - before);
     }
-
 };
 
 Population& population(size_t count)
@@ -152,7 +151,8 @@ void lookupByUuid(benchmark::State& state)
 void lookupByPath(benchmark::State& state)
 {
     Population& plugIns = population(size_t(state.range(0)));
-    lookUpEach(state, plugIns.paths(), [&](const std::string& path) { return plugIns.workspace()->plugInAtPath(path); });
+    lookUpEach(
+        state, plugIns.paths(), [&](const std::string& path) { return plugIns.workspace()->plugInAtPath(path); });
 }
 
 void queryByExtensionPoint(benchmark::State& state)

@@ -11,6 +11,7 @@
 #include "Ombrel/OMMakeError.h"
 #include "omd/OMDPlugIn.h"
 #include "platform/Fatal.h"
+#include "platform/OMError.h"
 #include "platform/Probes.h"
 #include "platform/Storage.h"
 #include "platform/Vlist.h"
@@ -51,7 +52,8 @@ std::string timestamp()
     char text[32];
     const std::time_t now = std::time(nullptr);
     std::tm utc {};
-    ::gmtime_r(&now, &utc);
+    if (::gmtime_r(&now, &utc) == nullptr)
+        return std::to_string(now);
     std::strftime(text, sizeof text, "%Y%m%dT%H%M%SZ", &utc);
     return text;
 }
@@ -170,7 +172,7 @@ void OMDAnnotationStore::preserveUnreadableFile()
         OMLog::ops().notice("kept the unreadable annotation database as %{public}@", copy);
     else if (errno != ENOENT)
         OMLog::ops().error("cannot keep the unreadable annotation database %{public}@: %{public}s; it is replaced",
-            path, std::strerror(errno));
+            path, OMError::errnoDescription(errno));
     m_unreadableOnDisk = false;
 }
 

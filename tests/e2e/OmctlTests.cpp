@@ -22,8 +22,8 @@
 #include "platform/Registrar.h"
 #include "platform/Vlist.h"
 #include "tests/support/BundleFixture.h"
-#include "tests/support/DaemonProcess.h"
 #include "tests/support/ChildProcess.h"
+#include "tests/support/DaemonProcess.h"
 #include "tests/support/RawConduitPeer.h"
 
 extern char** environ;

@@ -7,8 +7,8 @@
 
 #include "platform/Format.h"
 #include "tools/omctl/OmctlDiagnostics.h"
-#include "tools/omctl/OmctlRegistration.h"
 #include "tools/omctl/OmctlRegistrar.h"
+#include "tools/omctl/OmctlRegistration.h"
 
 namespace om {
 
