@@ -82,6 +82,8 @@ private:
 
     // Discovery's visibility rules for this client (TransactionMatch.cpp).
     bool visibleToClient(const std::shared_ptr<OMDPlugIn>& plugIn, uint64_t flags) const;
+    // Yes when one of the user's exclusions removes the plug-in.
+    bool excluded(const OMDPlugIn& plugIn, const Value& exclusions) const;
 
     // Request handlers, one per row of the dispatch table. Each finishes with done() or fail().
     void addPlugIns();
