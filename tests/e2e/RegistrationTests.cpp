@@ -18,6 +18,7 @@
 #include "tests/support/BundleFixture.h"
 #include "tests/support/ChildProcess.h"
 #include "tests/support/DaemonProcess.h"
+#include "tests/support/RegistrarDaemon.h"
 
 namespace om::test {
 namespace {
@@ -27,94 +28,38 @@ const std::string kShare = kSamples + "/Notes.app/PlugIns/Share.appex";
 const std::string kTemplates = kSamples + "/Notes.app/PlugIns/Templates.bundle";
 const std::string kFilters = kSamples + "/Photos.app/PlugIns/Filters.appex";
 
-uint64_t codeOf(const Value& reply)
-{
-    return reply["errorcode"].asUInt64().value_or(0);
-}
-
-std::string errorOf(const Value& reply)
-{
-    const std::string* text = reply.stringFor("error");
-    return text ? *text : std::string();
-}
-
-Value pathsRequest(std::string_view name, const std::vector<std::string>& paths)
-{
-    ArrayBuilder list;
-    for (const auto& path : paths)
-        list.append(Value::string(path));
-    return DictionaryBuilder(daemonRequest(name)).set("paths", list.build()).build();
-}
-
 class Registration : public ::testing::Test {
 protected:
     void SetUp() override { start(); }
 
-    // The Registrar's state lives in the fixture, so that a restarted daemon finds it again.
+    // The state lives in m_omd, so that a restarted daemon finds it again.
     void start()
     {
-        DaemonProcess::Options options;
-        options.executable = builtDaemonPath();
-        options.environment = {
-            { "REGISTRAR_DB", m_state.root() + "/registrar.db" },
-            { "REGISTRAR_CONTAINERS", m_state.root() + "/containers" },
-            { "REGISTRAR_SDK_DIR", kSamples + "/SDKs" },
-        };
-        m_daemon = std::make_unique<DaemonProcess>(options);
-        ASSERT_TRUE(m_daemon->waitForSocket()) << m_daemon->stderrText();
-        auto peer = DaemonPeer::connect(*m_daemon);
-        ASSERT_TRUE(peer);
-        m_peer.emplace(std::move(*peer));
+        ASSERT_TRUE(m_omd.start());
+        m_daemon = &m_omd.daemon();
     }
 
-    Value call(const Value& request)
-    {
-        auto reply = m_peer->call(request);
-        EXPECT_TRUE(reply) << "no reply to " << request.description() << "\n" << m_daemon->stderrText();
-        return reply.value_or(Value());
-    }
-
-    Value add(const std::vector<std::string>& paths) { return call(pathsRequest("add", paths)); }
-
-    // The Registrar's database as another process sees it, read-only.
-    std::shared_ptr<RegistrarWorkspace> registrar()
-    {
-        RegistrarWorkspace::Configuration configuration { m_state.root() + "/registrar.db", kSamples + "/SDKs",
-            m_state.root() + "/containers" };
-        auto workspace = RegistrarWorkspace::open(configuration, RegistrarWorkspace::Access::ReadOnly);
-        EXPECT_TRUE(workspace.ok()) << workspace.error().localizedDescription();
-        return workspace.ok() ? workspace.value() : nullptr;
-    }
-
-    std::optional<Uuid> registeredUuid(const std::string& path)
-    {
-        auto workspace = registrar();
-        auto record = workspace ? workspace->plugInAtPath(path) : nullptr;
-        return record ? std::optional<Uuid>(record->uuid()) : std::nullopt;
-    }
+    Value call(const Value& request) { return m_omd.call(request); }
+    Value add(const std::vector<std::string>& paths) { return m_omd.add(paths); }
+    std::shared_ptr<RegistrarWorkspace> registrar() { return m_omd.registrar(); }
+    std::optional<Uuid> registeredUuid(const std::string& path) { return m_omd.uuidAt(path); }
 
     // An entitled copy of omctl: the daemon reads entitlements from the client's executable.
     std::string entitledOmctl(const Value& entitlements)
     {
-        const std::string copy = m_state.root() + "/omctl";
-        std::filesystem::copy_file(
-            std::string(OM_BINARY_DIR) + "/tools/omctl/omctl", copy, std::filesystem::copy_options::overwrite_existing);
-        const std::string file = m_state.writeFile("entitlements.vlist", Vlist::writeXml(entitlements));
-        EXPECT_EQ(ChildProcess::capture({ std::string(OM_SOURCE_DIR) + "/scripts/entitle", copy, file }).status, 0);
-        return copy;
+        return m_omd.copyProgram(RegistrarDaemon::omctlPath(), m_omd.state().root() + "/omctl", entitlements);
     }
 
     ChildProcess::Outcome omctl(const std::string& program, const std::vector<std::string>& arguments)
     {
         std::vector<std::string> argv = { program };
         argv.insert(argv.end(), arguments.begin(), arguments.end());
-        return ChildProcess::capture(argv, { { "CONDUIT_DIR", m_daemon->conduitDirectory() } });
+        return m_omd.run(argv);
     }
 
-    BundleFixture m_state;
+    RegistrarDaemon m_omd;
     BundleFixture m_bundles;
-    std::unique_ptr<DaemonProcess> m_daemon;
-    std::optional<DaemonPeer> m_peer;
+    DaemonProcess* m_daemon = nullptr;
 };
 
 TEST_F(Registration, PathWalkAnswersEachBadElementWithItsCodeAndText)
