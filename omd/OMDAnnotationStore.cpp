@@ -54,8 +54,8 @@ std::string timestamp()
     std::tm utc {};
     if (::gmtime_r(&now, &utc) == nullptr)
         return std::to_string(now);
-    std::strftime(text, sizeof text, "%Y%m%dT%H%M%SZ", &utc);
-    return text;
+    const size_t length = std::strftime(text, sizeof text, "%Y%m%dT%H%M%SZ", &utc);
+    return std::string(text, length);
 }
 
 } // namespace
