@@ -111,6 +111,7 @@ void OMDAnnotationStore::setAnnotation(const Value& annotation, const OMDPlugIn&
 
 void OMDAnnotationStore::setAnnotationForKey(const Value& annotation, const std::string& key)
 {
+    m_text.forget(key);
     if (annotation.isNone()) {
         m_annotations.erase(key);
     } else {
@@ -143,6 +144,7 @@ std::optional<OMError> OMDAnnotationStore::loadDb(const std::string& url)
             static_cast<int>(kDatabaseVersion)));
     }
     m_annotations.clear();
+    m_text.clear();
     for (const auto& [key, annotation] : (*root)["data"].entries())
         m_annotations.emplace(key, annotation);
     return std::nullopt;
@@ -150,9 +152,7 @@ std::optional<OMError> OMDAnnotationStore::loadDb(const std::string& url)
 
 std::optional<OMError> OMDAnnotationStore::saveDb()
 {
-    const Value root
-        = Value::dictionary({ { "version", Value::integer(kDatabaseVersion) }, { "data", annotations() } });
-    const std::string text = Vlist::writeXml(root);
+    const std::string& text = m_text.compose(m_annotations, kDatabaseVersion);
     if (m_unreadableOnDisk)
         preserveUnreadableFile();
     auto written = Storage::writeFileAtomically(

@@ -10,6 +10,7 @@
 #include <string>
 #include <string_view>
 
+#include "omd/OMDAnnotationText.h"
 #include "platform/OMError.h"
 #include "platform/Value.h"
 
@@ -56,6 +57,7 @@ private:
 
     const std::string m_annotationsURL;
     std::map<std::string, Value> m_annotations;
+    OMDAnnotationText m_text; // the file's text, entry by entry
     // The file at m_annotationsURL could not be read as a table; set until a save replaces it.
     bool m_unreadableOnDisk = false;
 };

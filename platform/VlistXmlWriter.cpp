@@ -285,6 +285,13 @@ std::string VlistXmlWriter::write(const Value& value)
     return out;
 }
 
+void VlistXmlWriter::appendDictionaryEntry(std::string& out, std::string_view key, const Value& value, unsigned level)
+{
+    std::string escaped;
+    appendEscaped(escaped, key);
+    appendEntry(out, escaped, value, level);
+}
+
 bool VlistXmlWriter::representable(std::string_view text)
 {
     for (size_t at = 0; at < text.size();) {

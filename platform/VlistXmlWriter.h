@@ -19,6 +19,11 @@ public:
     // value must not be none.
     static std::string write(const Value& value);
 
+    // The lines of one dictionary entry at the indentation of level, exactly as write() puts them
+    // inside a dictionary at that level: for documents assembled from entries that change one at a
+    // time. key must be representable; value must not be none.
+    static void appendDictionaryEntry(std::string& out, std::string_view key, const Value& value, unsigned level);
+
     // True when every character of text is written as itself (escaped or not).
     static bool representable(std::string_view text);
 };
