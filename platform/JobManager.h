@@ -90,8 +90,13 @@ Result<JobLaunch> JobManagerLaunch(const std::string& executablePathOrBundleIden
 // The running instances.
 Result<std::vector<JobInstanceInfo>> JobManagerList();
 
-// Service name to use instead of kJobManagerServiceName (tests, a second jobd); empty restores it.
+// One request to jobd on its own connection: the reply when its status is success, otherwise an
+// error whose code is the status. For the other clients of jobd (process assertions).
+Result<Value> JobManagerCall(const Value& request);
+
+// Service name to use instead of kJobManagerServiceName (tests, a second jobd); empty restores
+// it. Without one, JOBD_SERVICE_NAME (which jobd sets for its instances) is used when set.
 void JobManagerSetServiceName(const std::string& serviceName);
-const std::string& JobManagerServiceName();
+std::string JobManagerServiceName();
 
 } // namespace om
