@@ -12,6 +12,14 @@
 // most 2^20 data items, every container, tag, map key and scalar counting as one
 // (Cbor::kMaxItems). A frame beyond any of them is invalid.
 //
+// Descriptors (an addition to the wire contract; peers that never pass any see no change): a frame
+// of kind 1-3 may carry up to kMaxDescriptors open descriptors. Their number is in bits 4-6 of the
+// kind byte and they travel as SCM_RIGHTS on the sendmsg that writes the frame's first byte. The
+// receiver installs them close-on-exec and hands them over with the frame's event or reply;
+// whatever nobody takes is closed. Descriptors that arrive without a frame that declares them,
+// fewer than a frame declares, more than kMaxDescriptors at once, or a truncated control message
+// are a protocol error like any other.
+//
 // Blame is explicit: a malformed frame, a reply to nothing, a frame over the limit or a peer whose
 // unread output would need more than CONDUIT_MAX_PENDING bytes of memory is a protocol error. It
 // is logged, that connection is closed, and nothing it decoded is delivered. Other connections
@@ -27,9 +35,11 @@
 #include <functional>
 #include <memory>
 #include <string>
+#include <vector>
 
 #include "platform/Process.h"
 #include "platform/Result.h"
+#include "platform/UniqueFd.h"
 #include "platform/Value.h"
 #include "platform/WorkQueue.h"
 
@@ -42,11 +52,17 @@ enum ConduitErrorCode : int64_t {
     kConduitTerminationImminent = 2, // "Termination imminent"
 };
 
+// Descriptors that travel with one frame.
+using ConduitDescriptors = std::vector<UniqueFd>;
+
 struct ConduitEvent {
     enum class Kind : uint8_t { Message, ConnectionInvalid, TerminationImminent };
     Kind kind = Kind::Message;
     Value message; // Kind::Message: the decoded item (any kind, not only dictionaries)
     uint64_t requestId = 0; // non-zero when the peer awaits a reply (frame kind 2)
+    // The frame's descriptors, null when it carried none. A handler may move them out; those left
+    // are closed with the last copy of the event.
+    std::shared_ptr<ConduitDescriptors> descriptors;
 
     bool expectsReply() const { return requestId != 0; }
 };
@@ -55,12 +71,18 @@ class ConduitConnection : public std::enable_shared_from_this<ConduitConnection>
 public:
     using EventHandler = std::function<void(const ConduitEvent&)>;
     using ReplyHandler = std::function<void(Result<Value>)>;
+    // A reply handler that also takes the descriptors the reply carried (empty on an error).
+    using DescriptorReplyHandler = std::function<void(Result<Value>, ConduitDescriptors)>;
 
     // A client connection to a named service. Never fails here: when the service cannot be
     // reached, the connection becomes invalid once resumed, and every request sent on it gets a
     // kConduitConnectionInvalid error. targetQueue null: deliver on the I/O thread.
     static std::shared_ptr<ConduitConnection> connectToService(
         const std::string& serviceName, std::shared_ptr<WorkQueue> targetQueue);
+    // A connection over a connected stream socket made elsewhere (one end of a socketpair handed
+    // over by another process). Made non-blocking and close-on-exec here; the peer facts are
+    // those the kernel gives for the socket.
+    static std::shared_ptr<ConduitConnection> adoptSocket(UniqueFd socket, std::shared_ptr<WorkQueue> targetQueue);
     ~ConduitConnection();
 
     // Set before resume(); later calls are ignored.
@@ -78,6 +100,12 @@ public:
     // Frame kind 3 answering the peer's request requestId. Written directly when the socket takes
     // it; dropped silently when the connection is gone.
     void sendReply(uint64_t requestId, const Value& reply);
+    // The same with descriptors (at most Conduit::kMaxDescriptors), which the connection takes
+    // over and closes once they are written or the connection is gone.
+    void send(const Value& message, ConduitDescriptors descriptors);
+    void sendReply(uint64_t requestId, const Value& reply, ConduitDescriptors descriptors);
+    void sendWithReplyDescriptors(const Value& request, ConduitDescriptors descriptors,
+        std::shared_ptr<WorkQueue> queue, DescriptorReplyHandler handler);
 
     // Peer facts captured at connection time (for client connections: the service's process).
     const AuditToken& auditToken() const { return m_auditToken; }
@@ -143,6 +171,8 @@ public:
     static bool isValidServiceName(const std::string& serviceName);
     // Largest frame payload accepted and sent (16 MiB).
     static constexpr uint32_t kMaxPayload = 16u << 20;
+    // Most descriptors one frame may carry.
+    static constexpr size_t kMaxDescriptors = 4;
     // CONDUIT_MAX_PENDING (bytes), default 64 MiB: the memory one connection's unwritten output may
     // take, allocation and all.
     static size_t maxPendingBytes();

@@ -65,6 +65,25 @@ std::shared_ptr<ConduitConnection> ConduitConnection::connectToService(
     return connection;
 }
 
+std::shared_ptr<ConduitConnection> ConduitConnection::adoptSocket(
+    UniqueFd socket, std::shared_ptr<WorkQueue> targetQueue)
+{
+    AuditToken token;
+    if (socket.valid()) {
+        const int flags = ::fcntl(socket.get(), F_GETFL);
+        if (flags < 0 || ::fcntl(socket.get(), F_SETFL, flags | O_NONBLOCK) < 0
+            || ::fcntl(socket.get(), F_SETFD, FD_CLOEXEC) < 0) {
+            ConduitIoThread::log().error("cannot adopt socket %d: %s", socket.get(), OMError::errnoDescription(errno));
+            socket.reset();
+        } else if (auto peer = Process::peerOf(socket.get()); peer.ok()) {
+            token = std::move(peer).releaseValue();
+        }
+    }
+    auto connection = State::make(State::Role::Peer, std::move(socket), std::move(token), std::string());
+    connection->m_state->m_targetQueue = std::move(targetQueue);
+    return connection;
+}
+
 void ConduitConnection::setEventHandler(EventHandler handler)
 {
     if (!m_state->m_resumed.load())
@@ -101,6 +120,23 @@ void ConduitConnection::sendWithReply(const Value& request, std::shared_ptr<Work
 void ConduitConnection::sendReply(uint64_t requestId, const Value& reply)
 {
     m_state->write(ConduitFrame::Kind::Reply, requestId, reply, std::nullopt);
+}
+
+void ConduitConnection::send(const Value& message, ConduitDescriptors descriptors)
+{
+    m_state->write(ConduitFrame::Kind::Message, 0, message, std::nullopt, std::move(descriptors));
+}
+
+void ConduitConnection::sendReply(uint64_t requestId, const Value& reply, ConduitDescriptors descriptors)
+{
+    m_state->write(ConduitFrame::Kind::Reply, requestId, reply, std::nullopt, std::move(descriptors));
+}
+
+void ConduitConnection::sendWithReplyDescriptors(const Value& request, ConduitDescriptors descriptors,
+    std::shared_ptr<WorkQueue> queue, DescriptorReplyHandler handler)
+{
+    m_state->write(ConduitFrame::Kind::Request, 0, request,
+        State::PendingReply { std::move(queue), nullptr, std::move(handler) }, std::move(descriptors));
 }
 
 void ConduitConnection::setContext(std::shared_ptr<void> context)

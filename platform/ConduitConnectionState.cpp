@@ -35,6 +35,35 @@ ssize_t sendSome(int fd, const uint8_t* bytes, size_t size)
     return ssize_t(written);
 }
 
+// Writes what the socket takes now of bytes, the descriptors going with the first byte: the count
+// written (0 when the socket is full), or -1 with errno when the peer is gone.
+ssize_t sendWithDescriptors(int fd, const uint8_t* bytes, size_t size, const ConduitDescriptors& descriptors)
+{
+    alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int) * Conduit::kMaxDescriptors)] = {};
+    iovec vector { const_cast<uint8_t*>(bytes), size };
+    msghdr message {};
+    message.msg_iov = &vector;
+    message.msg_iovlen = 1;
+    message.msg_control = control;
+    message.msg_controllen = CMSG_SPACE(sizeof(int) * descriptors.size());
+    cmsghdr* header = CMSG_FIRSTHDR(&message);
+    header->cmsg_level = SOL_SOCKET;
+    header->cmsg_type = SCM_RIGHTS;
+    header->cmsg_len = CMSG_LEN(sizeof(int) * descriptors.size());
+    auto* fds = reinterpret_cast<int*>(CMSG_DATA(header));
+    for (size_t i = 0; i < descriptors.size(); ++i)
+        fds[i] = descriptors[i].get();
+    ssize_t result;
+    do {
+        result = ::sendmsg(fd, &message, MSG_NOSIGNAL | MSG_DONTWAIT);
+    } while (result < 0 && errno == EINTR);
+    if (result < 0)
+        return errno == EAGAIN || errno == EWOULDBLOCK ? 0 : -1;
+    // The descriptors went with the first byte; the rest is ordinary output.
+    const ssize_t rest = sendSome(fd, bytes + result, size - size_t(result));
+    return rest < 0 ? -1 : result + rest;
+}
+
 } // namespace
 
 std::shared_ptr<ConduitConnection> ConduitConnection::State::make(
@@ -112,10 +141,10 @@ void ConduitConnection::State::cancel()
     ConduitIoThread::shared().post([self = m_owner.shared_from_this()] { self->m_state->closeNow(std::nullopt); });
 }
 
-void ConduitConnection::State::write(
-    ConduitFrame::Kind kind, uint64_t replyTo, const Value& payload, std::optional<PendingReply> reply)
+void ConduitConnection::State::write(ConduitFrame::Kind kind, uint64_t replyTo, const Value& payload,
+    std::optional<PendingReply> reply, ConduitDescriptors descriptors)
 {
-    auto frame = ConduitFrame::encode(kind, replyTo, payload);
+    auto frame = ConduitFrame::encode(kind, replyTo, payload, descriptors.size());
     if (!frame.ok()) {
         ConduitIoThread::log().error("cannot send to pid %d: %s", peerPid(), frame.error().localizedDescription());
         if (reply)
@@ -138,7 +167,7 @@ void ConduitConnection::State::write(
         ConduitFrame::setId(frame.value(), id);
         m_pending.emplace(id, std::move(*reply));
     }
-    enqueueLocked(frame.value());
+    enqueueLocked(frame.value(), std::move(descriptors));
 }
 
 void ConduitConnection::State::terminationImminent()
@@ -146,17 +175,27 @@ void ConduitConnection::State::terminationImminent()
     write(ConduitFrame::Kind::TerminationImminent, 0, Value(), std::nullopt);
 }
 
-void ConduitConnection::State::enqueueLocked(std::span<const uint8_t> frame)
+// Frames whose descriptors wait in the outbound queue; beyond it the peer counts as not reading.
+constexpr size_t kMaxQueuedDescriptorFrames = 64;
+
+void ConduitConnection::State::enqueueLocked(std::span<const uint8_t> frame, ConduitDescriptors descriptors)
 {
     if (m_outbound.empty() && m_socket.valid()) {
-        const ssize_t written = sendSome(m_socket.get(), frame.data(), frame.size());
+        const ssize_t written = descriptors.empty()
+            ? sendSome(m_socket.get(), frame.data(), frame.size())
+            : sendWithDescriptors(m_socket.get(), frame.data(), frame.size(), descriptors);
         if (written < 0)
             return; // the peer is gone; reading will see the end of the stream
+        if (written > 0)
+            descriptors.clear(); // written with the first byte
+        m_outboundOffset += size_t(written);
         frame = frame.subspan(size_t(written));
         if (frame.empty())
             return;
     }
-    if (!m_outbound.append(frame, Conduit::maxPendingBytes())) {
+    const uint64_t offset = m_outboundOffset + m_outbound.size();
+    if (m_outboundDescriptors.size() >= kMaxQueuedDescriptorFrames
+        || !m_outbound.append(frame, Conduit::maxPendingBytes())) {
         m_invalid = true;
         const size_t pending = m_outbound.size() + frame.size();
         ConduitIoThread::shared().post([self = m_owner.shared_from_this(), pending] {
@@ -165,7 +204,16 @@ void ConduitConnection::State::enqueueLocked(std::span<const uint8_t> frame)
         });
         return;
     }
+    if (!descriptors.empty())
+        m_outboundDescriptors.push_back(OutboundDescriptors { offset, std::move(descriptors) });
     armWriteLocked();
+}
+
+void ConduitConnection::State::discardOutboundLocked()
+{
+    m_outboundOffset += m_outbound.size();
+    m_outbound.clear();
+    m_outboundDescriptors.clear();
 }
 
 void ConduitConnection::State::armWriteLocked()
@@ -179,13 +227,31 @@ void ConduitConnection::State::armWriteLocked()
 void ConduitConnection::State::flush()
 {
     std::lock_guard lock(m_mutex);
-    if (!m_outbound.empty() && m_socket.valid()) {
-        const ssize_t written = sendSome(m_socket.get(), m_outbound.data(), m_outbound.size());
-        if (written < 0)
-            m_outbound.clear(); // the peer is gone; reading will see the end of the stream
-        else
-            m_outbound.consume(size_t(written));
-        if (!m_outbound.empty())
+    while (!m_outbound.empty() && m_socket.valid()) {
+        // Up to the next frame with descriptors, or from it up to the one after.
+        size_t limit = m_outbound.size();
+        const OutboundDescriptors* attached = nullptr;
+        for (const auto& entry : m_outboundDescriptors) {
+            const size_t at = size_t(entry.offset - m_outboundOffset);
+            if (at == 0) {
+                attached = &entry;
+                continue;
+            }
+            limit = std::min(limit, at);
+            break;
+        }
+        const ssize_t written = attached
+            ? sendWithDescriptors(m_socket.get(), m_outbound.data(), limit, attached->descriptors)
+            : sendSome(m_socket.get(), m_outbound.data(), limit);
+        if (written < 0) {
+            discardOutboundLocked(); // the peer is gone; reading will see the end of the stream
+            break;
+        }
+        m_outbound.consume(size_t(written));
+        m_outboundOffset += size_t(written);
+        if (attached && written > 0)
+            m_outboundDescriptors.pop_front();
+        if (size_t(written) < limit)
             return; // EAGAIN: stay armed
     }
     if (m_writeArmed && m_ioKey != 0) {
@@ -205,13 +271,24 @@ void ConduitConnection::State::handleEvents(uint32_t events)
 void ConduitConnection::State::readAvailable()
 {
     static uint8_t chunk[kReadChunk]; // the I/O thread is the only reader
+    alignas(cmsghdr) static char control[CMSG_SPACE(sizeof(int) * Conduit::kMaxDescriptors)];
     size_t budget = kReadBudget;
     while (budget > 0 && m_socket.valid()) {
-        const ssize_t count = ::recv(m_socket.get(), chunk, sizeof chunk, MSG_DONTWAIT);
+        iovec vector { chunk, sizeof chunk };
+        msghdr message {};
+        message.msg_iov = &vector;
+        message.msg_iovlen = 1;
+        message.msg_control = control;
+        message.msg_controllen = sizeof control;
+        // The kernel ends a read after a write that carried descriptors, so one read brings the
+        // descriptors of at most one frame.
+        const ssize_t count = ::recvmsg(m_socket.get(), &message, MSG_DONTWAIT | MSG_CMSG_CLOEXEC);
+        if (count >= 0 && !receiveDescriptors(message))
+            return;
         if (count > 0) {
             budget -= std::min(budget, size_t(count));
             m_reader.append({ chunk, size_t(count) });
-            if (!drainFrames())
+            if (!drainFrames() || !checkStrayDescriptors())
                 return;
             // A short read emptied the socket; epoll is level-triggered, so anything arriving
             // later wakes us again, and a second recv here would only return EAGAIN.
@@ -229,6 +306,50 @@ void ConduitConnection::State::readAvailable()
         }
         return;
     }
+}
+
+// Takes the descriptors a read brought; false once the connection is closed over them.
+bool ConduitConnection::State::receiveDescriptors(msghdr& message)
+{
+    if (message.msg_controllen == 0 && !(message.msg_flags & MSG_CTRUNC))
+        return true;
+    for (cmsghdr* header = CMSG_FIRSTHDR(&message); header; header = CMSG_NXTHDR(&message, header)) {
+        if (header->cmsg_level != SOL_SOCKET || header->cmsg_type != SCM_RIGHTS)
+            continue;
+        const size_t count = (header->cmsg_len - CMSG_LEN(0)) / sizeof(int);
+        const auto* fds = reinterpret_cast<const int*>(CMSG_DATA(header));
+        for (size_t i = 0; i < count; ++i) {
+            int fd;
+            std::memcpy(&fd, fds + i, sizeof fd);
+            m_inbound.emplace_back(fd);
+        }
+    }
+    if (message.msg_flags & MSG_CTRUNC) {
+        closeNow(OMError::platform(kPlatformErrorLimit,
+            "more than " + std::to_string(Conduit::kMaxDescriptors) + " descriptors (truncated control message)"));
+        return false;
+    }
+    if (m_inbound.size() > Conduit::kMaxDescriptors) {
+        closeNow(OMError::platform(
+            kPlatformErrorLimit, std::to_string(m_inbound.size()) + " descriptors waiting for one frame"));
+        return false;
+    }
+    return true;
+}
+
+// Descriptors arrive with the first byte of their frame: once the complete frames have taken
+// theirs, any left over must belong to the frame in progress and match what it declares.
+bool ConduitConnection::State::checkStrayDescriptors()
+{
+    if (m_inbound.empty())
+        return true;
+    const auto declared = m_reader.descriptorsInProgress();
+    if (m_reader.buffered() == 0 || (declared && *declared != m_inbound.size())) {
+        closeNow(OMError::platform(kPlatformErrorMalformed,
+            std::to_string(m_inbound.size()) + " descriptors without a frame that declares them"));
+        return false;
+    }
+    return true;
 }
 
 // False once the connection is closed.
@@ -249,10 +370,24 @@ bool ConduitConnection::State::drainFrames()
 
 bool ConduitConnection::State::handleFrame(ConduitFrame frame)
 {
+    SharedDescriptors descriptors;
+    if (frame.descriptorCount > 0) {
+        if (m_inbound.size() < frame.descriptorCount) {
+            closeNow(OMError::platform(kPlatformErrorMalformed,
+                "frame declares " + std::to_string(frame.descriptorCount) + " descriptors; "
+                    + std::to_string(m_inbound.size()) + " arrived"));
+            return false;
+        }
+        descriptors = std::make_shared<ConduitDescriptors>();
+        for (uint8_t i = 0; i < frame.descriptorCount; ++i) {
+            descriptors->push_back(std::move(m_inbound.front()));
+            m_inbound.pop_front();
+        }
+    }
     switch (frame.kind) {
     case ConduitFrame::Kind::Message:
     case ConduitFrame::Kind::Request:
-        deliver(ConduitEvent { ConduitEvent::Kind::Message, std::move(frame.payload), frame.id });
+        deliver(ConduitEvent { ConduitEvent::Kind::Message, std::move(frame.payload), frame.id, std::move(descriptors) });
         return true;
     case ConduitFrame::Kind::TerminationImminent:
         deliver(ConduitEvent { ConduitEvent::Kind::TerminationImminent, Value(), 0 });
@@ -273,7 +408,7 @@ bool ConduitConnection::State::handleFrame(ConduitFrame frame)
             kPlatformErrorMalformed, "reply to request " + std::to_string(frame.id) + ", which is not outstanding"));
         return false;
     }
-    completeNow(std::move(*reply), std::move(frame.payload));
+    completeNow(std::move(*reply), std::move(frame.payload), std::move(descriptors));
     return true;
 }
 
@@ -286,7 +421,8 @@ void ConduitConnection::State::closeNow(std::optional<OMError> protocolError)
             return;
         m_closed = m_invalid = true;
         pending.swap(m_pending);
-        m_outbound.clear();
+        discardOutboundLocked();
+        m_inbound.clear();
         if (m_ioKey != 0)
             ConduitIoThread::shared().remove(m_socket.get(), m_ioKey);
         m_ioKey = 0;
@@ -337,22 +473,36 @@ void ConduitConnection::State::dispatch(const ConduitEvent& event)
         handler(event);
 }
 
-void ConduitConnection::State::completeNow(PendingReply reply, Result<Value> result)
+namespace {
+
+ConduitDescriptors takeAll(const std::shared_ptr<ConduitDescriptors>& descriptors)
 {
-    if (!reply.handler)
-        return;
-    if (!reply.queue)
+    return descriptors ? std::move(*descriptors) : ConduitDescriptors();
+}
+
+} // namespace
+
+void ConduitConnection::State::completeNow(PendingReply reply, Result<Value> result, SharedDescriptors descriptors)
+{
+    if (!reply.queue && reply.descriptorHandler)
+        return reply.descriptorHandler(std::move(result), takeAll(descriptors));
+    if (!reply.queue && reply.handler)
         return reply.handler(std::move(result));
-    completeLater(std::move(reply), std::move(result));
+    completeLater(std::move(reply), std::move(result), std::move(descriptors));
 }
 
 // Never runs the handler on the caller's stack, which may hold locks of its own.
-void ConduitConnection::State::completeLater(PendingReply reply, Result<Value> result)
+void ConduitConnection::State::completeLater(PendingReply reply, Result<Value> result, SharedDescriptors descriptors)
 {
-    if (!reply.handler)
+    if (!reply.handler && !reply.descriptorHandler)
         return;
-    auto work
-        = [handler = std::move(reply.handler), result = std::move(result)]() mutable { handler(std::move(result)); };
+    auto work = [handler = std::move(reply.handler), descriptorHandler = std::move(reply.descriptorHandler),
+                    result = std::move(result), descriptors = std::move(descriptors)]() mutable {
+        if (descriptorHandler)
+            descriptorHandler(std::move(result), takeAll(descriptors));
+        else
+            handler(std::move(result));
+    };
     if (reply.queue)
         reply.queue->async(std::move(work));
     else

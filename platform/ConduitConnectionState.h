@@ -7,7 +7,10 @@
 // is serial: on the target queue when there is one, else inline on the I/O thread.
 #pragma once
 
+#include <sys/socket.h>
+
 #include <atomic>
+#include <deque>
 #include <memory>
 #include <mutex>
 #include <optional>
@@ -30,6 +33,7 @@ struct ConduitConnection::State final : ConduitIoThread::Source {
     struct PendingReply {
         std::shared_ptr<WorkQueue> queue; // null: the I/O thread
         ReplyHandler handler;
+        DescriptorReplyHandler descriptorHandler; // instead of handler, when the caller takes descriptors
     };
 
     // socket invalid: a client whose service could not be reached; it is born closed.
@@ -41,7 +45,8 @@ struct ConduitConnection::State final : ConduitIoThread::Source {
 
     void resume();
     void cancel();
-    void write(ConduitFrame::Kind kind, uint64_t replyTo, const Value& payload, std::optional<PendingReply> reply);
+    void write(ConduitFrame::Kind kind, uint64_t replyTo, const Value& payload, std::optional<PendingReply> reply,
+        ConduitDescriptors descriptors = {});
     void terminationImminent();
     std::string describe() const;
 
@@ -61,8 +66,11 @@ private:
     void readAvailable();
     bool drainFrames();
     bool handleFrame(ConduitFrame frame);
+    bool receiveDescriptors(msghdr& message);
+    bool checkStrayDescriptors();
     void flush();
-    void enqueueLocked(std::span<const uint8_t> frame);
+    void enqueueLocked(std::span<const uint8_t> frame, ConduitDescriptors descriptors);
+    void discardOutboundLocked();
     void armWriteLocked();
     void closeNow(std::optional<OMError> protocolError);
     void deliver(ConduitEvent event);
@@ -70,8 +78,9 @@ private:
     void deliverInvalid();
     pid_t peerPid() const { return m_owner.m_auditToken.pid; }
 
-    static void completeNow(PendingReply reply, Result<Value> result);
-    static void completeLater(PendingReply reply, Result<Value> result);
+    using SharedDescriptors = std::shared_ptr<ConduitDescriptors>;
+    static void completeNow(PendingReply reply, Result<Value> result, SharedDescriptors descriptors = nullptr);
+    static void completeLater(PendingReply reply, Result<Value> result, SharedDescriptors descriptors = nullptr);
     static OMError invalidError();
 
     ConduitConnection& m_owner;
@@ -85,11 +94,19 @@ private:
     std::unordered_map<uint64_t, PendingReply> m_pending;
     // Unwritten output, charged against Conduit::maxPendingBytes() by what it allocates.
     ByteQueue m_outbound;
+    // Descriptors waiting in m_outbound, each with the stream offset of the frame they go with.
+    struct OutboundDescriptors {
+        uint64_t offset;
+        ConduitDescriptors descriptors;
+    };
+    std::deque<OutboundDescriptors> m_outboundDescriptors;
+    uint64_t m_outboundOffset = 0; // stream offset of m_outbound's first byte
     uint64_t m_ioKey = 0; // registration with the I/O thread; 0 when not registered
     bool m_writeArmed = false;
 
     // I/O thread only.
     ConduitFrameReader m_reader;
+    std::deque<UniqueFd> m_inbound; // received descriptors not yet claimed by a frame
     bool m_invalidDelivered = false;
 };
 

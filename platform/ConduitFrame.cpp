@@ -35,6 +35,15 @@ void writeLe(uint8_t* out, uint64_t value, size_t size)
         out[i] = uint8_t(value & 0xff);
 }
 
+constexpr uint8_t kKindMask = 0x0f;
+constexpr unsigned kDescriptorShift = 4;
+constexpr uint8_t kDescriptorMask = 0x70;
+
+uint8_t descriptorsOf(uint8_t kindByte)
+{
+    return uint8_t((kindByte & kDescriptorMask) >> kDescriptorShift);
+}
+
 bool isKnownKind(uint8_t kind)
 {
     return kind >= uint8_t(ConduitFrame::Kind::Message) && kind <= uint8_t(ConduitFrame::Kind::TerminationImminent);
@@ -79,8 +88,11 @@ std::optional<std::string> ConduitFrame::whyNotCarriable(const Value& value)
     return checkCarriable(value, 0);
 }
 
-Result<std::vector<uint8_t>> ConduitFrame::encode(Kind kind, uint64_t id, const Value& payload)
+Result<std::vector<uint8_t>> ConduitFrame::encode(Kind kind, uint64_t id, const Value& payload, size_t descriptorCount)
 {
+    if (descriptorCount > Conduit::kMaxDescriptors || (descriptorCount > 0 && kind == Kind::TerminationImminent))
+        return OMError::platform(
+            kPlatformErrorLimit, std::to_string(descriptorCount) + " descriptors cannot travel with one frame");
     std::vector<uint8_t> frame(kHeaderSize);
     if (kind != Kind::TerminationImminent) {
         if (auto problem = whyNotCarriable(payload))
@@ -92,7 +104,7 @@ Result<std::vector<uint8_t>> ConduitFrame::encode(Kind kind, uint64_t id, const 
         return OMError::platform(
             kPlatformErrorLimit, "message of " + std::to_string(payloadSize) + " bytes exceeds the frame limit");
     writeLe(frame.data(), kMinLength + payloadSize, kLengthSize);
-    frame[kKindOffset] = uint8_t(kind);
+    frame[kKindOffset] = uint8_t(uint8_t(kind) | descriptorCount << kDescriptorShift);
     writeLe(frame.data() + kIdOffset, id, 8);
     return frame;
 }
@@ -131,10 +143,17 @@ std::optional<OMError> ConduitFrameReader::checkHeader() const
         return OMError::platform(kPlatformErrorLimit, "frame length " + std::to_string(length) + " out of range");
     if (available <= kKindOffset)
         return std::nullopt;
-    const uint8_t kind = header[kKindOffset];
-    if (!isKnownKind(kind))
-        return OMError::platform(kPlatformErrorMalformed, "unknown frame kind " + std::to_string(kind));
+    const uint8_t kindByte = header[kKindOffset];
+    const uint8_t kind = kindByte & kKindMask;
+    if (!isKnownKind(kind) || (kindByte & ~(kKindMask | kDescriptorMask)) != 0)
+        return OMError::platform(kPlatformErrorMalformed, "unknown frame kind " + std::to_string(kindByte));
     const auto frameKind = ConduitFrame::Kind(kind);
+    const uint8_t descriptors = descriptorsOf(kindByte);
+    if (descriptors > Conduit::kMaxDescriptors)
+        return OMError::platform(
+            kPlatformErrorLimit, "frame declares " + std::to_string(descriptors) + " descriptors");
+    if (descriptors > 0 && frameKind == ConduitFrame::Kind::TerminationImminent)
+        return OMError::platform(kPlatformErrorMalformed, "termination frame with descriptors");
     if (frameKind == ConduitFrame::Kind::TerminationImminent && length != ConduitFrame::kMinLength)
         return OMError::platform(kPlatformErrorMalformed, "termination frame with a payload");
     if (frameKind != ConduitFrame::Kind::TerminationImminent && length == ConduitFrame::kMinLength)
@@ -177,7 +196,8 @@ Result<std::optional<ConduitFrame>> ConduitFrameReader::next()
         return std::optional<ConduitFrame>();
 
     ConduitFrame frame;
-    frame.kind = ConduitFrame::Kind(header[kKindOffset]);
+    frame.kind = ConduitFrame::Kind(header[kKindOffset] & kKindMask);
+    frame.descriptorCount = descriptorsOf(header[kKindOffset]);
     frame.id = readLe64(header + kIdOffset);
     if (frame.kind == ConduitFrame::Kind::Request)
         m_lastRequestId = frame.id;
@@ -191,6 +211,13 @@ Result<std::optional<ConduitFrame>> ConduitFrameReader::next()
     }
     m_buffer.consume(kLengthSize + length);
     return std::optional<ConduitFrame>(std::move(frame));
+}
+
+std::optional<uint8_t> ConduitFrameReader::descriptorsInProgress() const
+{
+    if (buffered() <= kKindOffset)
+        return std::nullopt;
+    return descriptorsOf(m_buffer.data()[kKindOffset]);
 }
 
 std::optional<OMError> ConduitFrameReader::finish() const

@@ -4,6 +4,10 @@
 // byte, a little-endian u64 id and L - 9 bytes of payload: one CBOR item for kinds 1-3, nothing for
 // kind 4. The reader checks every header field as soon as its bytes are in, and holds only the
 // bytes that actually arrived, so a header that claims 16 MiB costs nothing until 16 MiB come.
+//
+// Descriptors: the kind byte's bits 4-6 count the descriptors that travel with a frame of kind 1-3
+// (at most Conduit::kMaxDescriptors); the low four bits are the kind. The descriptors themselves
+// travel out of band, as SCM_RIGHTS on the sendmsg that writes the frame's first byte.
 #pragma once
 
 #include <cstddef>
@@ -29,10 +33,11 @@ struct ConduitFrame {
     Kind kind = Kind::Message;
     uint64_t id = 0;
     Value payload; // none for TerminationImminent
+    uint8_t descriptorCount = 0; // descriptors the frame declares (kinds 1-3)
 
     // Header plus the CBOR encoding of payload (nothing for TerminationImminent). Fails when the
     // payload cannot travel: none inside, nesting deeper than the decoder accepts, or too large.
-    static Result<std::vector<uint8_t>> encode(Kind kind, uint64_t id, const Value& payload);
+    static Result<std::vector<uint8_t>> encode(Kind kind, uint64_t id, const Value& payload, size_t descriptorCount = 0);
     // Rewrites the id of an encoded frame (requests get theirs only when they are queued).
     static void setId(std::vector<uint8_t>& frame, uint64_t id);
     // Why value cannot travel (a none inside, more than Cbor::kMaxDepth nested containers, text
@@ -55,6 +60,9 @@ public:
 
     // At end of stream: an error when a frame was cut short.
     std::optional<OMError> finish() const;
+
+    // The descriptor count the frame in progress declares; none before its kind byte is in.
+    std::optional<uint8_t> descriptorsInProgress() const;
 
     // Bytes held for frames not yet complete.
     size_t buffered() const { return m_buffer.size(); }

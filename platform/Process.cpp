@@ -7,10 +7,15 @@
 #include <sys/syscall.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <mutex>
+#include <optional>
+#include <string>
+#include <vector>
 
 #ifndef SO_PEERPIDFD
 #define SO_PEERPIDFD 77
@@ -129,6 +134,74 @@ Result<AuditToken> Process::peerOf(int socketFd)
     if (opened.valid())
         token.pidfd = std::make_shared<const UniqueFd>(std::move(opened));
     return token;
+}
+
+namespace {
+
+// The fields of /proc/<pid>/stat after the command name, which is parenthesised and may itself
+// hold spaces and parentheses: field 3 (state) is the first.
+std::optional<std::vector<std::string>> statFields(pid_t pid)
+{
+    UniqueFd file(::open(procPath(pid, "stat").c_str(), O_RDONLY | O_CLOEXEC));
+    if (!file.valid())
+        return std::nullopt;
+    char buffer[1024];
+    const ssize_t length = ::read(file.get(), buffer, sizeof buffer - 1);
+    if (length <= 0)
+        return std::nullopt;
+    const std::string text(buffer, size_t(length));
+    const size_t close = text.rfind(')');
+    if (close == std::string::npos)
+        return std::nullopt;
+    std::vector<std::string> fields;
+    size_t at = close + 1;
+    while (at < text.size()) {
+        while (at < text.size() && text[at] == ' ')
+            ++at;
+        const size_t end = std::min(text.find(' ', at), text.size());
+        if (end > at)
+            fields.push_back(text.substr(at, end - at));
+        at = end;
+    }
+    return fields;
+}
+
+constexpr size_t kParentField = 1; // field 4
+constexpr size_t kStartTimeField = 19; // field 22
+
+} // namespace
+
+Result<AuditToken> Process::forPid(pid_t pid)
+{
+    if (pid <= 0)
+        return OMError::fromErrno("process " + std::to_string(pid), ESRCH);
+    UniqueFd pidfd = pidfdOpen(pid);
+    if (!pidfd.valid())
+        return OMError::fromErrno("pidfd_open " + std::to_string(pid), errno);
+    struct stat info {};
+    if (::stat(procPath(pid, "").c_str(), &info) < 0)
+        return OMError::fromErrno("stat " + procPath(pid, ""), errno);
+    return AuditToken { pid, info.st_uid, info.st_gid, std::make_shared<const UniqueFd>(std::move(pidfd)) };
+}
+
+Result<uint64_t> Process::startTime(const AuditToken& token)
+{
+    auto fields = statFields(token.pid);
+    if (!fields || fields->size() <= kStartTimeField)
+        return goneError(token);
+    const uint64_t ticks = std::strtoull((*fields)[kStartTimeField].c_str(), nullptr, 10);
+    // Checked after reading: if the process still runs now, the pid was its own when we read.
+    if (!stillRunning(token))
+        return goneError(token);
+    return ticks;
+}
+
+std::optional<pid_t> Process::parentOf(pid_t pid)
+{
+    auto fields = statFields(pid);
+    if (!fields || fields->size() <= kParentField)
+        return std::nullopt;
+    return pid_t(std::strtol((*fields)[kParentField].c_str(), nullptr, 10));
 }
 
 AuditToken Process::self()

@@ -29,6 +29,15 @@ public:
     // The peer of a connected Unix socket. Fails with EMFILE or ENFILE when the process has no
     // descriptor left for the pidfd: a peer that cannot be pinned down is not to be served.
     static Result<AuditToken> peerOf(int socketFd);
+    // A token for a process named by pid alone, with a pidfd opened now. Whether the pid still
+    // names the process the caller means is for the caller to tell (see startTime).
+    static Result<AuditToken> forPid(pid_t pid);
+    // When the process started, in clock ticks since boot (/proc/<pid>/stat): with the pid, what
+    // tells one process from a later one that reused its pid. Verified against the pidfd.
+    static Result<uint64_t> startTime(const AuditToken& token);
+    // The parent of pid (/proc/<pid>/stat), as this process's pid namespace numbers it; none when
+    // pid is gone. Unverified: only a snapshot.
+    static std::optional<pid_t> parentOf(pid_t pid);
     // The token of this process (for tests and for the daemon's own identity).
     static AuditToken self();
 
