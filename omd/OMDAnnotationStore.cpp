@@ -68,7 +68,8 @@ std::string timestamp()
     std::tm utc {};
     if (::gmtime_r(&now, &utc) == nullptr)
         return std::to_string(now);
-    std::strftime(text, sizeof text, "%Y%m%dT%H%M%SZ", &utc);
+    if (std::strftime(text, sizeof text, "%Y%m%dT%H%M%SZ", &utc) == 0)
+        return std::to_string(now);
     return text;
 }
 
