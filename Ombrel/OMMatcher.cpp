@@ -1,5 +1,8 @@
 #include "Ombrel/OMMatcher.h"
 
+#include <cmath>
+#include <limits>
+
 #include "Ombrel/OMLog.h"
 #include "Ombrel/OMVersionString.h"
 #include "platform/ActivationRule.h"
@@ -22,6 +25,19 @@ bool isZero(const Value& value)
     return value.isNumber() && value.numericallyEquals(0);
 }
 
+// A real election truncated toward zero; NaN is 0 and the infinities saturate, where a plain cast
+// would be undefined.
+int64_t truncatedReal(double real)
+{
+    if (std::isnan(real))
+        return 0;
+    if (real >= 9223372036854775807.0)
+        return std::numeric_limits<int64_t>::max();
+    if (real <= -9223372036854775808.0)
+        return std::numeric_limits<int64_t>::min();
+    return static_cast<int64_t>(real);
+}
+
 } // namespace
 
 OMMatcher::OMMatcher(AnnotationLookup annotations)
@@ -38,7 +54,7 @@ std::string OMMatcher::electionText(const Value& annotation)
     else if (auto unsignedNumber = election.asUInt64())
         number = static_cast<int64_t>(*unsignedNumber);
     else if (auto real = election.asDouble())
-        number = static_cast<int64_t>(*real);
+        number = truncatedReal(*real);
     const auto masked = static_cast<int32_t>(static_cast<uint32_t>(number) & ~uint32_t(0xff00));
     return std::to_string(masked);
 }

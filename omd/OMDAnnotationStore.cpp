@@ -3,8 +3,10 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cmath>
 #include <cstring>
 #include <ctime>
+#include <filesystem>
 
 #include "Ombrel/OMBundle.h"
 #include "Ombrel/OMLog.h"
@@ -42,9 +44,21 @@ int64_t versionOf(const Value& root)
     const Value& version = root["version"];
     if (auto integer = version.asInt64())
         return *integer;
-    if (auto number = version.asDouble())
+    // A real version is truncated; one out of range (or NaN) is no version we know, and a plain
+    // cast of it would be undefined.
+    if (auto number = version.asDouble(); number && std::fabs(*number) < 9.0e18)
         return static_cast<int64_t>(*number);
-    return 0;
+    return version.isNumber() ? -1 : 0;
+}
+
+// A relative path names a file under the working directory; a file URL is always absolute.
+std::string absolute(const std::string& path)
+{
+    if (path.starts_with('/'))
+        return path;
+    std::error_code failed;
+    const auto resolved = std::filesystem::absolute(path, failed);
+    return failed ? path : resolved.lexically_normal().string();
 }
 
 std::string timestamp()
@@ -68,7 +82,7 @@ OMDAnnotationStore::OMDAnnotationStore(std::string annotationsURL)
 std::shared_ptr<OMDAnnotationStore> OMDAnnotationStore::initWithDatabase(const std::optional<std::string>& path)
 {
     std::shared_ptr<OMDAnnotationStore> store(
-        new OMDAnnotationStore(path ? OMBundle::fileURL(*path) : defaultDatabaseURL()));
+        new OMDAnnotationStore(path ? OMBundle::fileURL(absolute(*path)) : defaultDatabaseURL()));
     auto failure = store->loadDb(store->m_annotationsURL);
     if (!failure)
         return store;
@@ -145,8 +159,11 @@ std::optional<OMError> OMDAnnotationStore::loadDb(const std::string& url)
     }
     m_annotations.clear();
     m_text.clear();
-    for (const auto& [key, annotation] : (*root)["data"].entries())
-        m_annotations.emplace(key, annotation);
+    // Every reader of an entry takes it for a dictionary; anything else in a damaged file is dropped.
+    for (const auto& [key, annotation] : (*root)["data"].entries()) {
+        if (annotation.isDictionary())
+            m_annotations.emplace(key, annotation);
+    }
     return std::nullopt;
 }
 

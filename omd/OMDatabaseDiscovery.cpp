@@ -1,6 +1,7 @@
 // The discovery query's candidate search: the Registrar's records for a host's rules, with the
 // election prefilter pushed into the Registrar's query, turned into cached daemon records.
 #include <algorithm>
+#include <cmath>
 #include <unordered_set>
 
 #include "Ombrel/OMLog.h"
@@ -81,8 +82,8 @@ bool OMDatabase::passesPrefilter(
             election = *integer;
         else if (auto number = value.asUInt64())
             election = static_cast<int64_t>(*number);
-        else if (auto real = value.asDouble())
-            election = static_cast<int64_t>(*real);
+        else if (auto real = value.asDouble(); real && std::fabs(*real) < 9.0e18)
+            election = static_cast<int64_t>(*real); // NaN and values out of range stay 0
     } else {
         const Value& autoElect = entitlements[kAutoElectEntitlement];
         election = autoElect.isNumber() && !autoElect.numericallyEquals(0) ? 1 : 0;
