@@ -13,9 +13,12 @@
 #include <functional>
 #include <memory>
 #include <optional>
+#include <string>
 #include <string_view>
+#include <utility>
 #include <vector>
 
+#include "Ombrel/OMPlugInCore.h"
 #include "platform/Conduit.h"
 #include "platform/OMError.h"
 #include "platform/Result.h"
@@ -32,6 +35,13 @@ public:
 
     static constexpr const char* kDefaultServiceName = "com.orvex.ombrel.omd";
     static constexpr int64_t kCurrentProtocolVersion = 3;
+
+    // Discovery flags of matchPlugIns. OMDiscoverAll is honoured only for an unsandboxed client
+    // holding "com.orvex.private.ombrel.manager".
+    static constexpr uint64_t OMDiscoverAllVersions = 0x1;
+    static constexpr uint64_t OMDiscoverSameVersions = 0x4; // with OMDiscoverAllVersions
+    static constexpr uint64_t OMDiscoverSystemOnly = 0x8;
+    static constexpr uint64_t OMDiscoverAll = 0x200;
 
     // Connects to the named service (the daemon's default name when null). Connecting cannot fail
     // here: an unreachable service shows up as a transport error in the first reply.
@@ -74,6 +84,43 @@ public:
     // The whole tree as one transport value; only protocol version 3 has such an encoding.
     static std::optional<Value> convertToConduit(const Value& tree, int64_t version);
     std::optional<Value> convertFromConduit(const Value& message) const;
+
+    // One plug-in of a "match" reply: the record rebuilt from its form, and what the daemon adds
+    // to a form beyond what the record keeps.
+    struct MatchedPlugIn {
+        std::shared_ptr<OMPlugInCore> plugIn;
+        Value form; // as it arrived
+        // "extensions": resource name ("." for the whole bundle) to sandbox-extension token; empty
+        // when the plug-in shares nothing.
+        std::vector<std::pair<std::string, std::string>> resourceTokens;
+        std::optional<std::string> overrider; // UUID text of the returned plug-in that replaces this one
+        std::optional<std::string> overriding; // identifier of the plug-in this one replaces
+
+        // The stored election, as the daemon keeps it ("annotations" "election"); none when the user
+        // never made one.
+        Value election() const;
+        // Whether the election enables the plug-in, judged as discovery judges it: its low 8 bits.
+        bool elected() const;
+        // The values hosts keep about the plug-in ("annotations" "extension"), or none.
+        Value extension() const;
+        std::optional<std::string> resourceToken(std::string_view resource) const;
+    };
+    // A form that did not become a record, and why.
+    struct SkippedForm {
+        size_t index; // in the reply's array
+        std::string reason;
+    };
+    struct MatchReply {
+        Value reply; // the daemon's reply dictionary as it came
+        std::vector<MatchedPlugIn> matches; // in the reply's order
+        std::vector<SkippedForm> skipped;
+    };
+    // Reads the reply of matchPlugIns. An error reply (errorInReply) is that error; a "matches"
+    // that does not decode to an array is an error of code 4. A success without "matches" has
+    // none. Forms that are not dictionaries or that initWithForm refuses are skipped and listed.
+    Result<MatchReply> matchesInReply(const Result<Value>& reply) const;
+    // matchPlugIns, waited for, then matchesInReply.
+    Result<MatchReply> matchPlugInsSync(const Value& rules, uint64_t flags);
 
     // Blocking forms for tools and tests. They wait on the reply queue's work, so calling them
     // from a reply block (on the reply queue) would deadlock; that is an internal-consistency

@@ -6,9 +6,13 @@
 #include <ostream>
 
 #include "platform/Format.h"
+#include "tools/omctl/OmctlAnnotation.h"
 #include "tools/omctl/OmctlDiagnostics.h"
+#include "tools/omctl/OmctlDiscovery.h"
 #include "tools/omctl/OmctlRegistrar.h"
 #include "tools/omctl/OmctlRegistration.h"
+#include "tools/omctl/OmctlWatch.h"
+#include "tools/omctl/OmctlWhy.h"
 
 namespace om {
 
@@ -18,6 +22,12 @@ const OmctlCommand::Entry kCommands[] = {
     { "raw", "send a request dictionary (vlist file or JSON) and print the reply", OmctlDiagnostics::kRawHelp,
         OmctlDiagnostics::raw },
     { "ping", "check that omd answers, with the round-trip time", OmctlDiagnostics::kPingHelp, OmctlDiagnostics::ping },
+    { "match", "list the plug-ins that rules select, with their elections", OmctlDiscovery::kMatchHelp,
+        OmctlDiscovery::match },
+    { "elect", "turn the user's election of a plug-in on or off", OmctlAnnotation::kElectHelp, OmctlAnnotation::elect },
+    { "annotate", "set annotations of plug-ins", OmctlAnnotation::kAnnotateHelp, OmctlAnnotation::annotate },
+    { "why", "explain which rules show or hide a plug-in from a host", OmctlWhy::kHelp, OmctlWhy::why },
+    { "watch", "print omd's annotation-change notifications as they come", OmctlWatch::kHelp, OmctlWatch::watch },
     { "add", "register plug-in bundles", OmctlRegistration::kAddHelp, OmctlRegistration::add },
     { "remove", "unregister plug-in bundles", OmctlRegistration::kRemoveHelp, OmctlRegistration::remove },
     { "registrar", "list registered apps and plug-ins from the Registrar's database", OmctlRegistrar::kHelp,
@@ -46,8 +56,8 @@ void OmctlCommand::printHelp(std::ostream& out)
            "  --service NAME  the daemon's service name (default com.orvex.ombrel.omd)\n"
            "  --json          print results as JSON\n"
            "  -h, --help      show this help; 'omctl <command> --help' shows a command's\n\n"
-           "Exit status: 0 success, 1 omd answered with an error, 2 usage error,\n"
-           "3 omd could not be reached.\n\n"
+           "Exit status: 0 success, 1 omd answered with an error (or what was asked\n"
+           "cannot be done), 2 usage error, 3 omd could not be reached.\n\n"
            "omctl reports failures itself; EVLOG_LEVEL=debug (or info, default, error)\n"
            "also shows the client library's log.\n";
 }

@@ -46,6 +46,29 @@ void OmctlContext::print(const Value& value)
     m_out.flush();
 }
 
+int OmctlContext::failure(std::string_view command, std::string_view message)
+{
+    m_err << format("omctl: %s: %s\n", command, message);
+    return kOmctlDaemonError;
+}
+
+int OmctlContext::match(
+    std::string_view command, const Value& rules, uint64_t flags, OMDaemonClient::MatchReply& matches)
+{
+    OMDaemonClient& omd = client();
+    Result<Value> reply = omd.waitForReply([&](auto block) { omd.matchPlugIns(rules, flags, std::move(block)); });
+    if (const int status = outcome(reply); status != kOmctlSuccess)
+        return status;
+    auto read = omd.matchesInReply(reply);
+    if (!read.ok())
+        return failure(command, read.error().localizedDescription());
+    for (const auto& skipped : read->skipped)
+        m_err << format(
+            "omctl: %s: omd's plug-in %u is unreadable (%s); left out\n", command, skipped.index, skipped.reason);
+    matches = std::move(read).releaseValue();
+    return kOmctlSuccess;
+}
+
 int OmctlContext::outcome(const Result<Value>& reply)
 {
     if (!reply.ok()) {

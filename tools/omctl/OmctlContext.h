@@ -15,7 +15,7 @@ namespace om {
 
 enum OmctlExitStatus : int {
     kOmctlSuccess = 0,
-    kOmctlDaemonError = 1, // omd answered with an error
+    kOmctlDaemonError = 1, // omd answered with an error, or what was asked cannot be done
     kOmctlUsage = 2, // bad command line or unreadable input
     kOmctlUnreachable = 3, // no answer: the transport failed
 };
@@ -38,6 +38,13 @@ public:
     int usage(std::string_view message);
     // Prints a value on stdout, as JSON with --json and as an outline otherwise.
     void print(const Value& value);
+    // Prints "omctl: <command>: <message>" on stderr; answers kOmctlDaemonError, the status of a
+    // request that could not be done.
+    int failure(std::string_view command, std::string_view message);
+    // Sends "match" and reads the reply into records. Says on stderr what went wrong, and which
+    // forms did not become records; the exit status, kOmctlSuccess when matches is filled.
+    int match(std::string_view command, const Value& rules, uint64_t flags, OMDaemonClient::MatchReply& matches);
+
     // The exit status of a reply, after saying on stderr what went wrong: kOmctlUnreachable for a
     // transport error, kOmctlDaemonError for an error reply, kOmctlSuccess otherwise.
     int outcome(const Result<Value>& reply);

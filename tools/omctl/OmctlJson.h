@@ -1,5 +1,6 @@
 // JSON for omctl: requests typed on the command line become value trees, and replies are printed
-// as JSON for scripts.
+// as JSON for scripts. The lexical work (tokens, escapes, UTF-8, numbers) is nlohmann-json's; this
+// class maps its events onto the value tree and back.
 //
 // Mapping: objects are dictionaries (key order kept, a repeated key is an error), arrays, strings,
 // integers (signed when they fit 64 bits, unsigned above INT64_MAX, anything larger is an error),
@@ -12,8 +13,9 @@
 // The writer uses the same markers, so its output reads back as the same tree. A dictionary whose
 // only key is one of these markers cannot be written in JSON.
 //
-// The parser refuses nesting deeper than kMaxDepth, input over kMaxInputBytes, invalid UTF-8,
-// control characters in strings, bad escapes and unpaired surrogates, naming the byte offset.
+// The parser refuses nesting deeper than kMaxDepth (counted as containers are opened, so hostile
+// nesting never reaches the stack), input over kMaxInputBytes, invalid UTF-8, control characters
+// in strings, bad escapes and unpaired surrogates.
 #pragma once
 
 #include <cstddef>
@@ -30,31 +32,14 @@ public:
     static constexpr size_t kMaxDepth = 128;
     static constexpr size_t kMaxInputBytes = 16u << 20;
 
+    enum class Layout : uint8_t {
+        Indented, // two spaces per level, one entry per line
+        OneLine, // the whole value on one line, for line-oriented output
+    };
+
     static Result<Value> parse(std::string_view text);
-    // Indented with two spaces; none is written as null.
-    static std::string write(const Value& value);
-
-private:
-    explicit OmctlJson(std::string_view text)
-        : m_text(text)
-    {
-    }
-
-    bool parseValue(Value& out, size_t depth);
-    bool parseObject(Value& out, size_t depth);
-    bool parseArray(Value& out, size_t depth);
-    bool parseString(std::string& out);
-    bool parseEscape(std::string& out);
-    bool parseHex4(uint32_t& out);
-    bool parseNumber(Value& out);
-    bool parseLiteral(Value& out);
-    bool applyMarker(Value& out, const std::string& key, const Value& argument, size_t start);
-    void skipSpace();
-    bool fail(std::string what, size_t offset);
-
-    std::string_view m_text;
-    size_t m_position = 0;
-    std::string m_error;
+    // None is written as null.
+    static std::string write(const Value& value, Layout layout = Layout::Indented);
 };
 
 } // namespace om
