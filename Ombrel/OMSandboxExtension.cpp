@@ -20,12 +20,13 @@ bool isWithin(const std::string& path, const std::string& directory)
 // A token for resourcePath that grants nothing outside the bundle (canonical): a plug-in names its
 // shared resources itself, and "../" or a link inside the bundle must not carry a grant elsewhere.
 // The checked canonical path is what goes into the token, so nothing can change it in between.
-Result<std::string> issueWithin(const Result<std::string>& canonicalBundle, const std::string& resourcePath)
+// The bundle itself (".") is its own canonical path, resolved once for all its resources.
+Result<std::string> issueWithin(const Result<std::string>& canonicalBundle, const std::string& resourcePath, bool whole)
 {
     if (!canonicalBundle.ok())
         return canonicalBundle.error();
     const std::string& bundle = *canonicalBundle;
-    const std::string resource = OM_TRY(Sandbox::canonicalPath(resourcePath));
+    const std::string resource = whole ? bundle : OM_TRY(Sandbox::canonicalPath(resourcePath));
     if (!isWithin(resource, bundle))
         return OMError("POSIX", EACCES, resource + " lies outside " + bundle);
     return Sandbox::issueFileExtension(Sandbox::kReadOnlyFileClass, resource, 0);
@@ -79,7 +80,7 @@ Value OMSandboxExtension::issueForResources(const std::string& bundlePath, const
         if (!name)
             continue;
         const std::string resourcePath = *name == "." ? bundlePath : bundlePath + "/" + *name;
-        auto token = issueWithin(bundle, resourcePath);
+        auto token = issueWithin(bundle, resourcePath, *name == ".");
         if (!token.ok()) {
             OMLog::ops().info("failed to make extension for %@ in plug-in at %@: %{public}s", Value(resourcePath),
                 Value(bundlePath), systemMessageOf(token.error()));

@@ -35,9 +35,14 @@ public:
         if (!::mkdtemp(pattern.data()))
             std::abort();
         m_root = pattern;
-        for (size_t app = 0; app < std::min(count, kApplications); ++app)
+        // Complete applications (an Info.vlist naming an executable that exists), so that discovery
+        // does not pass their plug-ins over as those of a placeholder.
+        for (size_t app = 0; app < std::min(count, kApplications); ++app) {
             write(appPath(app) + "/Info.vlist",
-                Value::dictionary({ { "VBBundleIdentifier", Value("com.orvex.bench.app" + std::to_string(app)) } }));
+                Value::dictionary({ { "VBBundleIdentifier", Value("com.orvex.bench.app" + std::to_string(app)) },
+                    { "VBBundleExecutable", "App" } }));
+            std::ofstream(appPath(app) + "/App") << "#!/bin/sh\n";
+        }
         for (size_t i = 0; i < count; ++i) {
             const std::string identifier = "com.orvex.bench.plugin" + std::to_string(i);
             const std::string path = appPath(i % kApplications) + "/PlugIns/" + identifier + ".appex";

@@ -13,6 +13,7 @@
 #include <cstdlib>
 #include <ctime>
 #include <filesystem>
+#include <mutex>
 #include <optional>
 
 #include "platform/Digest.h"
@@ -67,9 +68,8 @@ Result<void> makeKey(const std::string& path)
 
 // A key anyone but its owner could read lets them forge tokens; one they could write lets them
 // choose the key. Either is refused rather than used.
-Result<Key> readKey(int fd, const std::string& path)
+Result<Key> readKey(int fd, const std::string& path, struct stat& info)
 {
-    struct stat info;
     if (::fstat(fd, &info) < 0)
         return OMError::fromErrno("fstat " + path, errno);
     if (!S_ISREG(info.st_mode))
@@ -95,9 +95,33 @@ Result<Key> readKey(int fd, const std::string& path)
     return key;
 }
 
-Result<Key> loadKey()
+// The key last read, with what identified its file then. Issuing a token per plug-in of a large
+// discovery reply made reading the file the most costly part of issuing; a stat tells whether the
+// file is still the one read, and a change of owner or mode changes its ctime.
+struct CachedKey {
+    std::mutex mutex;
+    std::string path;
+    dev_t device = 0;
+    ino_t inode = 0;
+    timespec changed {};
+    std::optional<Key> key;
+};
+
+CachedKey& cachedKey()
 {
-    const std::string path = Sandbox::keyPath();
+    static CachedKey cache;
+    return cache;
+}
+
+bool sameFile(const CachedKey& cache, const std::string& path, const struct stat& info)
+{
+    return cache.key && cache.path == path && cache.device == info.st_dev && cache.inode == info.st_ino
+        && cache.changed.tv_sec == info.st_ctim.tv_sec && cache.changed.tv_nsec == info.st_ctim.tv_nsec;
+}
+
+// info receives what identified the file read.
+Result<Key> readKeyFile(const std::string& path, struct stat& info)
+{
     // O_NONBLOCK: something other than a file planted at the key's path must not hang the caller.
     constexpr int kFlags = O_RDONLY | O_NONBLOCK | O_NOCTTY | O_CLOEXEC;
     UniqueFd file(::open(path.c_str(), kFlags));
@@ -107,7 +131,27 @@ Result<Key> loadKey()
     }
     if (!file.valid())
         return OMError::fromErrno("open " + path, errno);
-    return readKey(file.get(), path);
+    return readKey(file.get(), path, info);
+}
+
+Result<Key> loadKey()
+{
+    const std::string path = Sandbox::keyPath();
+    CachedKey& cache = cachedKey();
+    struct stat info;
+    if (::stat(path.c_str(), &info) == 0) {
+        std::lock_guard lock(cache.mutex);
+        if (sameFile(cache, path, info))
+            return *cache.key;
+    }
+    Key key = OM_TRY(readKeyFile(path, info));
+    std::lock_guard lock(cache.mutex);
+    cache.path = path;
+    cache.device = info.st_dev;
+    cache.inode = info.st_ino;
+    cache.changed = info.st_ctim;
+    cache.key = key;
+    return key;
 }
 
 std::string hexOf(std::span<const uint8_t> bytes)

@@ -226,14 +226,27 @@ void WorkQueue::sync(const std::function<void()>& work)
         internalInconsistency("sync onto work queue \"" + m_label + "\" from code already running on it");
     auto protect = shared_from_this(); // the closure may drop the caller's reference to this queue
     refuseCycle(); // from here on, the caller is recorded as waiting for this queue
-    auto barrier = std::make_shared<SyncBarrier>();
-    async([barrier] { barrier->holdQueue(); });
-    barrier->waitUntilHeld();
+
+    // An idle queue is taken on the spot: nothing queued earlier is left to run, and the queue's
+    // thread, asleep, is told to start nothing until the caller is done. Otherwise a barrier item
+    // waits its turn and parks the thread while the caller runs.
+    std::shared_ptr<SyncBarrier> barrier;
+    {
+        std::lock_guard lock(m_mutex);
+        if (m_running || m_heldBySync || !m_items.empty())
+            barrier = std::make_shared<SyncBarrier>();
+        else
+            m_heldBySync = true;
+    }
+    if (barrier) {
+        async([barrier] { barrier->holdQueue(); });
+        barrier->waitUntilHeld();
+    }
 
     struct Hold {
         WorkQueue* queue;
-        SyncBarrier& barrier;
-        Hold(WorkQueue* q, SyncBarrier& b)
+        SyncBarrier* barrier;
+        Hold(WorkQueue* q, SyncBarrier* b)
             : queue(q)
             , barrier(b)
         {
@@ -251,9 +264,20 @@ void WorkQueue::sync(const std::function<void()>& work)
                 std::lock_guard lock(cycleCheckMutex());
                 queue->m_syncHolder = nullptr;
             }
-            barrier.release();
+            if (barrier) {
+                barrier->release();
+                return;
+            }
+            bool wake;
+            {
+                std::lock_guard lock(queue->m_mutex);
+                queue->m_heldBySync = false;
+                wake = !queue->m_items.empty();
+            }
+            if (wake)
+                queue->m_wake.notify_one();
         }
-    } hold(this, *barrier);
+    } hold(this, barrier.get());
     work();
 }
 
@@ -286,11 +310,12 @@ void WorkQueue::run()
         std::function<void()> item;
         {
             std::unique_lock lock(m_mutex);
-            m_wake.wait(lock, [this] { return m_stopping || !m_items.empty(); });
+            m_wake.wait(lock, [this] { return m_stopping || (!m_items.empty() && !m_heldBySync); });
             if (m_items.empty())
                 break;
             item = std::move(m_items.front());
             m_items.pop_front();
+            m_running = true;
         }
         item();
         item = nullptr; // may release the last reference to this queue
@@ -301,6 +326,8 @@ void WorkQueue::run()
             runOrphans(std::move(orphans));
             return;
         }
+        std::lock_guard lock(m_mutex);
+        m_running = false;
     }
     t_currentQueues.pop_back();
 }

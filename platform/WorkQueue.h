@@ -62,6 +62,10 @@ private:
     std::condition_variable m_wake;
     std::deque<std::function<void()>> m_items;
     bool m_stopping = false;
+    // Guarded by m_mutex. An item is running on the queue's thread; a caller of sync() holds the
+    // queue without the thread's help (it found the queue idle), so the thread starts nothing.
+    bool m_running = false;
+    bool m_heldBySync = false;
     std::thread m_thread;
     // Guarded by the cycle check's lock. The holder is the caller of sync() while it holds the
     // queue, else the queue's own thread (which waits for nothing while it is idle).

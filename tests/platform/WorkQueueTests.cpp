@@ -126,6 +126,37 @@ TEST(WorkQueue, SyncHoldsTheQueueUntilTheClosureReturns)
     EXPECT_FALSE(queue->isCurrent());
 }
 
+// Callers that find the queue idle take it without its thread; the others wait their turn behind
+// it. Either way no two closures or items overlap, which the unguarded counter (and TSan) check.
+TEST(WorkQueue, SyncCallersAndItemsNeverOverlap)
+{
+    auto queue = WorkQueue::create("com.orvex.test.contend");
+    int counter = 0;
+    int inside = 0;
+    bool overlapped = false;
+    auto enter = [&] {
+        overlapped = overlapped || inside++ != 0;
+        ++counter;
+        --inside;
+    };
+    std::vector<std::thread> callers;
+    for (int t = 0; t < 4; ++t) {
+        callers.emplace_back([&] {
+            for (int i = 0; i < 2000; ++i) {
+                if (i % 3 == 0)
+                    queue->async(enter);
+                else
+                    queue->sync(enter);
+            }
+        });
+    }
+    for (auto& caller : callers)
+        caller.join();
+    queue->sync([] {});
+    EXPECT_FALSE(overlapped);
+    EXPECT_EQ(counter, 8000);
+}
+
 TEST(WorkQueue, NestedSyncMakesBothQueuesCurrent)
 {
     auto outer = WorkQueue::create("com.orvex.test.outer");
