@@ -155,8 +155,8 @@ TEST_F(JobdFaults, JobdThatIsNotRunningFailsAtOnce)
     ASSERT_FALSE(listed.ok());
     EXPECT_EQ(listed.error().code(), kJobManagerUnreachable);
     Mailbox<int> completion;
-    JobManagerRemoveService("com.example.echo", "1", WorkQueue::create("test.killer"),
-        [&](int status) { completion.push(status); });
+    JobManagerRemoveService(
+        "com.example.echo", "1", WorkQueue::create("test.killer"), [&](int status) { completion.push(status); });
     EXPECT_EQ(completion.pop(), std::optional<int>(kJobManagerUnreachable));
 }
 

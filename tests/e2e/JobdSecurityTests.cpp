@@ -1,6 +1,5 @@
 // jobd's refusals, each tried for real: launching without a grant or with another process's,
 // granting without the entitlement, and reaching out of the sandbox (files, network, tokens).
-#include <netinet/in.h>
 #include <sys/socket.h>
 #include <unistd.h>
 
@@ -8,6 +7,8 @@
 
 #include "platform/Sandbox.h"
 #include "tests/e2e/JobdTestSupport.h"
+
+#include <netinet/in.h>
 
 namespace om::test {
 namespace {
@@ -137,8 +138,7 @@ TEST_F(JobdSandbox, InstanceReadsOnlyItsBundleContainerAndGrantedPaths)
     for (const auto& [path, readable] : cases)
         EXPECT_EQ(instance->canRead(path), readable) << path;
     // The container is the writable home; the bundle is not writable.
-    EXPECT_EQ(instance->ask(Value::dictionary({ { "op", "write" }, { "path", ownFile + ".new" } }))["ok"],
-        Value(true));
+    EXPECT_EQ(instance->ask(Value::dictionary({ { "op", "write" }, { "path", ownFile + ".new" } }))["ok"], Value(true));
     EXPECT_EQ(instance->ask(Value::dictionary({ { "op", "write" }, { "path", m_dir + "/Reader.appex/new" } }))["ok"],
         Value(false));
 }

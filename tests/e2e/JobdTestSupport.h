@@ -50,7 +50,7 @@ public:
         : m_pid(launch.pid)
         , m_connection(ConduitConnection::adoptSocket(std::move(launch.connection), nullptr))
     {
-        m_connection->setEventHandler([](const ConduitEvent&) { });
+        m_connection->setEventHandler([](const ConduitEvent&) {});
         m_connection->resume();
     }
     ~HostedInstance() { m_connection->cancel(); }
@@ -143,9 +143,9 @@ protected:
         std::vector<Value> extensions(tokens.begin(), tokens.end());
         return Value::dictionary({
             { "ConduitService",
-                Value::dictionary({ { "EnvironmentVariables", Value::dictionary(variables) },
-                    { "_SandboxProfile", profile }, { "_OmitSandboxParameters", true },
-                    { "_SandboxExtensions", Value::array(extensions) } }) },
+                Value::dictionary(
+                    { { "EnvironmentVariables", Value::dictionary(variables) }, { "_SandboxProfile", profile },
+                        { "_OmitSandboxParameters", true }, { "_SandboxExtensions", Value::array(extensions) } }) },
             { "VBBundlePackageType", "CND!" },
         });
     }

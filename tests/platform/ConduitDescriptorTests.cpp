@@ -31,12 +31,12 @@ struct Pipe {
 // Descriptors of this process that name the same file as fd.
 size_t openCopies(int fd)
 {
-    struct stat wanted {};
+    struct stat wanted { };
     if (::fstat(fd, &wanted) < 0)
         return 0;
     size_t count = 0;
     for (const auto& entry : std::filesystem::directory_iterator("/proc/self/fd")) {
-        struct stat info {};
+        struct stat info { };
         if (::stat(entry.path().c_str(), &info) == 0 && info.st_dev == wanted.st_dev && info.st_ino == wanted.st_ino)
             ++count;
     }
@@ -102,7 +102,9 @@ TEST_F(ConduitDescriptorPassing, RequestAndReplyCarryDescriptorsBothWays)
     }
     Mailbox<std::pair<Result<Value>, ConduitDescriptors>> outcome;
     client.connection->sendWithReplyDescriptors(Value::dictionary({ { "hello", 1 } }), std::move(outgoing), nullptr,
-        [&](Result<Value> reply, ConduitDescriptors fds) { outcome.push({ std::move(reply), std::move(fds) }); });
+        [&](Result<Value> reply, ConduitDescriptors fds) {
+            outcome.push({ std::move(reply), std::move(fds) });
+        });
     auto answer = outcome.pop();
     ASSERT_TRUE(answer);
     ASSERT_TRUE(answer->first.ok());
@@ -165,11 +167,13 @@ std::vector<HostileDescriptors> hostileDescriptorCases()
         { "FewerThanDeclared", declaresTwo, {}, 1 },
         { "MoreThanAllowedInOneMessage", frameDeclaring(1, 0, 4), {}, Conduit::kMaxDescriptors + 1 },
         { "CountBeyondTheLimit", frameDeclaring(1, 0, 5), {}, 1 },
-        { "TerminationFrameWithDescriptors", [] {
-             auto bytes = RawConduitPeer::header(9, 4, 0);
-             bytes[4] = 4 | 1 << 4;
-             return bytes;
-         }(), {}, 1 },
+        { "TerminationFrameWithDescriptors",
+            [] {
+                auto bytes = RawConduitPeer::header(9, 4, 0);
+                bytes[4] = 4 | 1 << 4;
+                return bytes;
+            }(),
+            {}, 1 },
         { "DescriptorsOnAPartialHeaderOfAFrameThatDeclaresNone", headStart, headRest, 1 },
     };
 }
@@ -223,7 +227,7 @@ TEST_F(ConduitDescriptorPassing, AdoptedSocketpairSpeaksConduit)
     });
     server->resume();
     auto client = ConduitConnection::adoptSocket(UniqueFd(pair[1]), nullptr);
-    client->setEventHandler([](const ConduitEvent&) { });
+    client->setEventHandler([](const ConduitEvent&) {});
     client->resume();
     Mailbox<Result<Value>> outcome;
     client->sendWithReply(Value::dictionary({ { "n", 7 } }), nullptr, [&](Result<Value> r) { outcome.push(r); });

@@ -7,9 +7,7 @@
 //   {"op": "busy"} / {"op": "idle"}    -> {"status": what jobd answered the declaration}
 //   {"op": "exit", "status": N}        exits with N
 // With JOBD_TEST_IGNORE_TERM=1 it ignores SIGTERM. It exits 0 when the host closes the connection.
-#include <arpa/inet.h>
 #include <fcntl.h>
-#include <netinet/in.h>
 #include <signal.h>
 #include <sys/socket.h>
 #include <unistd.h>
@@ -22,6 +20,9 @@
 #include "platform/Assertions.h"
 #include "platform/Conduit.h"
 #include "platform/JobManager.h"
+
+#include <arpa/inet.h>
+#include <netinet/in.h>
 
 namespace {
 
