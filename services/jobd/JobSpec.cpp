@@ -98,7 +98,7 @@ Result<JobSpec> JobSpec::fromOverlay(const std::string& executablePath, const Va
 
     if (overlay.type() != Value::Type::Dictionary)
         return invalid("overlay is not a dictionary");
-    const Value service = overlay["ConduitService"];
+    const Value& service = overlay["ConduitService"];
     if (service.type() != Value::Type::Dictionary)
         return invalid("overlay has no ConduitService dictionary");
     const auto* profile = service["_SandboxProfile"].asString();
