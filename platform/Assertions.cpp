@@ -17,7 +17,7 @@ constexpr std::chrono::seconds kReplyTimeout { 15 };
 std::shared_ptr<Assertions> Assertions::create()
 {
     auto connection = ConduitConnection::connectToService(JobManagerServiceName(), nullptr);
-    connection->setEventHandler([](const ConduitEvent&) { });
+    connection->setEventHandler([](const ConduitEvent&) {});
     connection->resume();
     return std::shared_ptr<Assertions>(new Assertions(std::move(connection)));
 }

@@ -18,7 +18,8 @@
 // receiver installs them close-on-exec and hands them over with the frame's event or reply;
 // whatever nobody takes is closed. Descriptors that arrive without a frame that declares them,
 // fewer than a frame declares, more than kMaxDescriptors at once, or a truncated control message
-// are a protocol error like any other.
+// are a protocol error: the connection is closed and the descriptors with it (a frame that
+// completed before the violation showed may have been delivered, never with stray descriptors).
 //
 // Blame is explicit: a malformed frame, a reply to nothing, a frame over the limit or a peer whose
 // unread output would need more than CONDUIT_MAX_PENDING bytes of memory is a protocol error. It

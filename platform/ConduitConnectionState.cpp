@@ -387,7 +387,8 @@ bool ConduitConnection::State::handleFrame(ConduitFrame frame)
     switch (frame.kind) {
     case ConduitFrame::Kind::Message:
     case ConduitFrame::Kind::Request:
-        deliver(ConduitEvent { ConduitEvent::Kind::Message, std::move(frame.payload), frame.id, std::move(descriptors) });
+        deliver(
+            ConduitEvent { ConduitEvent::Kind::Message, std::move(frame.payload), frame.id, std::move(descriptors) });
         return true;
     case ConduitFrame::Kind::TerminationImminent:
         deliver(ConduitEvent { ConduitEvent::Kind::TerminationImminent, Value(), 0 });

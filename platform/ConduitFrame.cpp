@@ -150,8 +150,7 @@ std::optional<OMError> ConduitFrameReader::checkHeader() const
     const auto frameKind = ConduitFrame::Kind(kind);
     const uint8_t descriptors = descriptorsOf(kindByte);
     if (descriptors > Conduit::kMaxDescriptors)
-        return OMError::platform(
-            kPlatformErrorLimit, "frame declares " + std::to_string(descriptors) + " descriptors");
+        return OMError::platform(kPlatformErrorLimit, "frame declares " + std::to_string(descriptors) + " descriptors");
     if (descriptors > 0 && frameKind == ConduitFrame::Kind::TerminationImminent)
         return OMError::platform(kPlatformErrorMalformed, "termination frame with descriptors");
     if (frameKind == ConduitFrame::Kind::TerminationImminent && length != ConduitFrame::kMinLength)

@@ -37,7 +37,8 @@ struct ConduitFrame {
 
     // Header plus the CBOR encoding of payload (nothing for TerminationImminent). Fails when the
     // payload cannot travel: none inside, nesting deeper than the decoder accepts, or too large.
-    static Result<std::vector<uint8_t>> encode(Kind kind, uint64_t id, const Value& payload, size_t descriptorCount = 0);
+    static Result<std::vector<uint8_t>> encode(
+        Kind kind, uint64_t id, const Value& payload, size_t descriptorCount = 0);
     // Rewrites the id of an encoded frame (requests get theirs only when they are queued).
     static void setId(std::vector<uint8_t>& frame, uint64_t id);
     // Why value cannot travel (a none inside, more than Cbor::kMaxDepth nested containers, text

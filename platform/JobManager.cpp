@@ -45,7 +45,7 @@ Answer call(const Value& request, std::chrono::seconds timeout)
     };
     auto shared = std::make_shared<Shared>();
     auto connection = ConduitConnection::connectToService(JobManagerServiceName(), nullptr);
-    connection->setEventHandler([](const ConduitEvent&) { });
+    connection->setEventHandler([](const ConduitEvent&) {});
     connection->resume();
     connection->sendWithReplyDescriptors(request, {}, nullptr, [shared](Result<Value> reply, ConduitDescriptors fds) {
         std::lock_guard lock(shared->mutex);
@@ -90,8 +90,8 @@ Result<Value> checked(Answer& answer)
 
 int addService(const AuditToken& host, uint64_t startTime, const std::string& executablePath, const Value& overlay)
 {
-    return statusCall(Value::dictionary({ { "request", "add" }, { "pid", int64_t(host.pid) },
-                          { "start", startTime }, { "path", executablePath }, { "overlay", overlay } }),
+    return statusCall(Value::dictionary({ { "request", "add" }, { "pid", int64_t(host.pid) }, { "start", startTime },
+                          { "path", executablePath }, { "overlay", overlay } }),
         kReplyTimeout);
 }
 
@@ -142,7 +142,7 @@ void JobManagerRemoveService(const std::string& bundleIdentifier, const std::str
     std::shared_ptr<WorkQueue> queue, std::function<void(int)> completion)
 {
     auto connection = ConduitConnection::connectToService(JobManagerServiceName(), nullptr);
-    connection->setEventHandler([](const ConduitEvent&) { });
+    connection->setEventHandler([](const ConduitEvent&) {});
     connection->resume();
     // The connection stays alive through its own pending request; it ends with the answer.
     connection->sendWithReply(
@@ -155,8 +155,8 @@ void JobManagerRemoveService(const std::string& bundleIdentifier, const std::str
 
 Result<JobLaunch> JobManagerLaunch(const std::string& executablePathOrBundleIdentifier)
 {
-    auto answer = call(Value::dictionary({ { "request", "launch" }, { "target", executablePathOrBundleIdentifier } }),
-        kReplyTimeout);
+    auto answer = call(
+        Value::dictionary({ { "request", "launch" }, { "target", executablePathOrBundleIdentifier } }), kReplyTimeout);
     const Value reply = OM_TRY(checked(answer));
     if (answer.descriptors.size() != 1)
         return statusError(kJobManagerInvalid, "jobd answered a launch without a connection");

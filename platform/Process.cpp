@@ -178,7 +178,7 @@ Result<AuditToken> Process::forPid(pid_t pid)
     UniqueFd pidfd = pidfdOpen(pid);
     if (!pidfd.valid())
         return OMError::fromErrno("pidfd_open " + std::to_string(pid), errno);
-    struct stat info {};
+    struct stat info { };
     if (::stat(procPath(pid, "").c_str(), &info) < 0)
         return OMError::fromErrno("stat " + procPath(pid, ""), errno);
     return AuditToken { pid, info.st_uid, info.st_gid, std::make_shared<const UniqueFd>(std::move(pidfd)) };

@@ -38,6 +38,7 @@ struct Exec {
     }
     sigset_t none;
     sigemptyset(&none);
+    // NOLINTNEXTLINE(concurrency-mt-unsafe): the forked child has one thread.
     ::sigprocmask(SIG_SETMASK, &none, nullptr); // jobd blocks SIGTERM; the job must not inherit it
     ::execve(exec.argv[0], exec.argv.data(), exec.envp.data());
     ::_exit(127);

@@ -103,8 +103,8 @@ void JobServer::accept(const std::shared_ptr<ConduitConnection>& connection)
         if (event.kind != ConduitEvent::Kind::Message)
             return;
         if (client->inFlight.fetch_add(1) >= kMaxRequestsInFlight) {
-            log().error("pid %d has %zu requests waiting; closing its connection", client->token.pid,
-                kMaxRequestsInFlight);
+            log().error(
+                "pid %d has %zu requests waiting; closing its connection", client->token.pid, kMaxRequestsInFlight);
             client->connection->cancel();
             return;
         }

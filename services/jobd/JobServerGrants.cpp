@@ -73,11 +73,11 @@ void JobServer::addService(const std::shared_ptr<Request>& request)
         host->startTime = *start;
         host->generation = ++m_lastHostGeneration;
         std::weak_ptr<JobServer> weak = shared_from_this();
-        host->watchKey = m_watcher->watch(host->token.pidfd->get(),
-            [weak, hostPid = pid_t(*pid), generation = host->generation] {
-                if (auto self = weak.lock())
-                    self->hostExited(hostPid, generation);
-            });
+        host->watchKey
+            = m_watcher->watch(host->token.pidfd->get(), [weak, hostPid = pid_t(*pid), generation = host->generation] {
+                  if (auto self = weak.lock())
+                      self->hostExited(hostPid, generation);
+              });
         if (host->watchKey == 0)
             return reply(*request, kJobManagerLimit, "cannot watch host " + std::to_string(*pid));
         found = m_hosts.emplace(pid_t(*pid), std::move(host)).first;
@@ -165,8 +165,8 @@ void JobServer::launch(const std::shared_ptr<Request>& request)
         if (auto self = weak.lock())
             self->instanceExited(id);
     });
-    log().notice("launched %s for host %d: pid %d, profile %s", spec->bundleIdentifier, peer.pid, instance->pid,
-        spec->profile);
+    log().notice(
+        "launched %s for host %d: pid %d, profile %s", spec->bundleIdentifier, peer.pid, instance->pid, spec->profile);
     const pid_t pid = instance->pid;
     m_instances.emplace(instance->id, std::move(instance));
 

@@ -66,9 +66,8 @@ void JobServer::removeService(const std::shared_ptr<Request>& request)
     const auto* version = request->message.stringFor("version");
     if (!identifier || !version)
         return reply(*request, kJobManagerInvalid, "\"remove\" needs identifier and version");
-    const auto matches = [&](const JobSpec& spec) {
-        return spec.bundleIdentifier == *identifier && spec.version == *version;
-    };
+    const auto matches
+        = [&](const JobSpec& spec) { return spec.bundleIdentifier == *identifier && spec.version == *version; };
     // No host may start it again: what is being removed is being replaced or uninstalled.
     for (auto& [pid, host] : m_hosts)
         std::erase_if(host->grants, [&](const auto& grant) { return matches(*grant); });
@@ -135,11 +134,11 @@ void JobServer::instanceExited(uint64_t instanceId)
     if (::waitid(P_PIDFD, id_t(instance->pidfd.get()), &info, WEXITED) < 0)
         log().error("waitid for instance %d: %s", instance->pid, OMError::errnoDescription(errno));
     else if (info.si_code == CLD_EXITED)
-        log().info("instance %d of %s exited with status %d", instance->pid, instance->spec->bundleIdentifier,
-            info.si_status);
+        log().info(
+            "instance %d of %s exited with status %d", instance->pid, instance->spec->bundleIdentifier, info.si_status);
     else
-        log().info("instance %d of %s ended by signal %d", instance->pid, instance->spec->bundleIdentifier,
-            info.si_status);
+        log().info(
+            "instance %d of %s ended by signal %d", instance->pid, instance->spec->bundleIdentifier, info.si_status);
     for (auto& done : instance->whenGone)
         done();
 }
@@ -212,8 +211,9 @@ void JobServer::busy(const std::shared_ptr<Request>& request)
     std::vector<Value> instances;
     for (const auto& [id, instance] : m_instances) {
         if (instance->busyOwner && wanted.contains(instance->spec->bundleIdentifier))
-            instances.push_back(Value::dictionary({ { kJobManagerBundleIdentifierKey, instance->spec->bundleIdentifier },
-                { "pid", int64_t(instance->pid) } }));
+            instances.push_back(
+                Value::dictionary({ { kJobManagerBundleIdentifierKey, instance->spec->bundleIdentifier },
+                    { "pid", int64_t(instance->pid) } }));
     }
     reply(*request,
         Value::dictionary({ { "status", int64_t(kJobManagerSuccess) }, { "instances", Value::array(instances) } }));

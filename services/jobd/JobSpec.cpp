@@ -79,8 +79,9 @@ Result<JobSpec> JobSpec::fromOverlay(const std::string& executablePath, const Va
     JobSpec spec;
     if (executablePath.empty() || executablePath[0] != '/')
         return invalid("executable path is not absolute: " + executablePath);
-    struct stat file {};
-    if (::stat(executablePath.c_str(), &file) < 0 || !S_ISREG(file.st_mode) || ::access(executablePath.c_str(), X_OK) < 0)
+    struct stat file { };
+    if (::stat(executablePath.c_str(), &file) < 0 || !S_ISREG(file.st_mode)
+        || ::access(executablePath.c_str(), X_OK) < 0)
         return invalid("not an executable file: " + executablePath);
     auto bundle = Bundle::containingExecutable(executablePath);
     if (!bundle || !bundle->bundlePath())
@@ -97,7 +98,7 @@ Result<JobSpec> JobSpec::fromOverlay(const std::string& executablePath, const Va
 
     if (overlay.type() != Value::Type::Dictionary)
         return invalid("overlay is not a dictionary");
-    const Value service = overlay["ConduitService"];
+    const Value& service = overlay["ConduitService"];
     if (service.type() != Value::Type::Dictionary)
         return invalid("overlay has no ConduitService dictionary");
     const auto* profile = service["_SandboxProfile"].asString();

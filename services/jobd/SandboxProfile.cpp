@@ -45,7 +45,7 @@ Result<std::vector<std::string>> readStrings(const std::string& name, const Valu
 
 bool exists(const std::string& path)
 {
-    struct stat info {};
+    struct stat info { };
     return ::lstat(path.c_str(), &info) == 0;
 }
 
@@ -58,7 +58,8 @@ std::string SandboxProfile::directory()
     return configured && *configured ? configured : JOBD_PROFILES_DEFAULT;
 }
 
-Result<std::shared_ptr<const SandboxProfile>> SandboxProfile::load(const std::string& directory, const std::string& name)
+Result<std::shared_ptr<const SandboxProfile>> SandboxProfile::load(
+    const std::string& directory, const std::string& name)
 {
     auto root = Vlist::readFile(directory + "/" + name + ".vlist");
     if (!root.ok())
