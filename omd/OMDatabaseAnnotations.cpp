@@ -21,6 +21,8 @@ void OMDatabase::setAnnotation(const Value& annotation, const OMDPlugIn& plugIn)
 
 void OMDatabase::notifyAnnotationChange()
 {
+    // Logged before the reply that follows it, so that a reader of the log can count what was posted.
+    OMLog::ops().debug("posting %{public}s", kAnnotationChangeNotification);
     Notify::post(kAnnotationChangeNotification);
 }
 

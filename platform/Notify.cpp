@@ -80,7 +80,6 @@ void Notify::post(std::string_view name)
         log().error("not a notification name: %s", name);
         return;
     }
-    log().debug("posting %s", name);
     shared().enqueue(name);
 }
 
