@@ -14,6 +14,7 @@
 
 #include "platform/ConduitConnectionState.h"
 #include "platform/Fatal.h"
+#include "platform/PollTimeout.h"
 
 namespace om {
 
@@ -213,12 +214,7 @@ void ConduitIoThread::loop()
 // and spins through zero timeouts; -1 (forever) without timers.
 int ConduitIoThread::waitTimeout() const
 {
-    if (m_timers.empty())
-        return -1;
-    const auto left = m_timers.begin()->first - std::chrono::steady_clock::now();
-    if (left <= std::chrono::steady_clock::duration::zero())
-        return 0;
-    return int(std::min<int64_t>(std::chrono::ceil<std::chrono::milliseconds>(left).count(), INT32_MAX));
+    return m_timers.empty() ? -1 : pollTimeoutUntil(m_timers.begin()->first);
 }
 
 void ConduitIoThread::runDueTimers()

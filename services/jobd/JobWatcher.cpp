@@ -7,6 +7,8 @@
 #include <cerrno>
 #include <vector>
 
+#include "platform/PollTimeout.h"
+
 namespace om {
 
 namespace {
@@ -84,12 +86,7 @@ void JobWatcher::after(std::chrono::milliseconds delay, std::function<void()> wo
 // Milliseconds to the earliest timer, rounded up; -1 without timers. Under m_mutex.
 int JobWatcher::timeout()
 {
-    if (m_timers.empty())
-        return -1;
-    const auto left = m_timers.begin()->first - std::chrono::steady_clock::now();
-    if (left <= std::chrono::steady_clock::duration::zero())
-        return 0;
-    return int(std::min<int64_t>(std::chrono::ceil<std::chrono::milliseconds>(left).count(), INT32_MAX));
+    return m_timers.empty() ? -1 : pollTimeoutUntil(m_timers.begin()->first);
 }
 
 void JobWatcher::loop()

@@ -7,6 +7,7 @@
 #include <utility>
 
 #include "platform/Format.h"
+#include "tests/support/PrivateBus.h"
 #include "tests/support/RegistrarDaemon.h"
 
 namespace om::test {
@@ -22,16 +23,9 @@ class AnnotationRequests : public ::testing::Test {
 protected:
     void SetUp() override
     {
-        m_bus = std::make_unique<DaemonProcess>(helper("/usr/bin/dbus-daemon",
-            { "--session", "--nofork", "--address=unix:path=" + m_omd.state().root() + "/bus", "--print-address=2" }));
-        std::string address;
-        ASSERT_TRUE(m_bus->waitForLines([&](const auto& lines) {
-            for (const auto& line : lines) {
-                if (line.raw.starts_with("unix:"))
-                    address = line.raw;
-            }
-            return !address.empty();
-        })) << m_bus->stderrText();
+        m_bus = std::make_unique<PrivateBus>(m_omd.state().root());
+        const std::string& address = m_bus->address();
+        ASSERT_FALSE(address.empty()) << "dbus-daemon did not start: " << m_bus->log();
         auto listener = helper(std::string(OM_BINARY_DIR) + "/tests/om_test_listener", { kChange });
         listener.environment.emplace_back("DBUS_SESSION_BUS_ADDRESS", address);
         m_listener = std::make_unique<DaemonProcess>(listener);
@@ -86,7 +80,7 @@ protected:
         return posted - std::exchange(m_announced, posted);
     }
 
-    std::unique_ptr<DaemonProcess> m_bus;
+    std::unique_ptr<PrivateBus> m_bus;
     std::unique_ptr<DaemonProcess> m_listener;
     RegistrarDaemon m_omd;
     Uuid m_share;

@@ -13,6 +13,7 @@
 #include "tests/support/BundleFixture.h"
 #include "tests/support/ChildProcess.h"
 #include "tests/support/DaemonProcess.h"
+#include "tests/support/PrivateBus.h"
 #include "tools/omctl/OmctlJson.h"
 
 namespace om::test {
@@ -438,25 +439,12 @@ class OmctlWatch : public OmctlPlugIns {
 protected:
     void SetUp() override
     {
-        m_bus = std::make_unique<DaemonProcess>(DaemonProcess::Options {
-            .executable = "/usr/bin/dbus-daemon",
-            .arguments
-            = { "--session", "--nofork", "--address=unix:path=" + m_state.root() + "/bus", "--print-address=2" },
-            .logLevel = "",
-            .privateDatabase = false,
-        });
-        std::string address;
-        ASSERT_TRUE(m_bus->waitForLines([&](const auto& lines) {
-            for (const auto& line : lines) {
-                if (line.raw.starts_with("unix:"))
-                    address = line.raw;
-            }
-            return !address.empty();
-        })) << "dbus-daemon did not start";
-        start({ { "DBUS_SESSION_BUS_ADDRESS", address } });
+        m_bus = std::make_unique<PrivateBus>(m_state.root());
+        ASSERT_FALSE(m_bus->address().empty()) << "dbus-daemon did not start: " << m_bus->log();
+        start({ { "DBUS_SESSION_BUS_ADDRESS", m_bus->address() } });
     }
 
-    std::unique_ptr<DaemonProcess> m_bus;
+    std::unique_ptr<PrivateBus> m_bus;
 };
 
 TEST_F(OmctlWatch, PrintsALinePerNotificationUntilASignalThenExitsZero)
