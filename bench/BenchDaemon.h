@@ -221,7 +221,7 @@ private:
     // Polls: a benchmark may wait, and the daemon gives no other sign of readiness.
     bool waitForSocket()
     {
-        for (int attempt = 0; attempt < 1000; ++attempt) {
+        for (int attempt = 0; attempt < 12000; ++attempt) { // a large Registrar takes a while to open
             int fd = connectTo(m_socketPath);
             if (fd >= 0) {
                 ::close(fd);
