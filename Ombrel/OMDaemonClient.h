@@ -43,6 +43,12 @@ public:
     static constexpr uint64_t OMDiscoverSystemOnly = 0x8;
     static constexpr uint64_t OMDiscoverAll = 0x200;
 
+    // Flags of holdPlugins. Without OMLockFlagPlugInPaths each path names an application and all
+    // of its plug-ins are held.
+    static constexpr uint64_t OMLockFlagPlugInPaths = 0x1;
+    static constexpr uint64_t OMLockFlagCheckBusy = 0x2; // refuse the hold when one is busy
+    static constexpr uint64_t OMLockFlagTerminate = 0x4; // stop running instances before the reply
+
     // Connects to the named service (the daemon's default name when null). Connecting cannot fail
     // here: an unreachable service shows up as a transport error in the first reply.
     static std::shared_ptr<OMDaemonClient> initWithServiceName(const char* name);

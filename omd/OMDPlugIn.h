@@ -64,6 +64,9 @@ public:
 
     // None when the host may use the plug-in; otherwise why not.
     std::optional<std::string> allowForClient(const OMDConduitClient& client) const;
+    // A busy description ({kJobManagerBundleIdentifierKey: identifier}) when jobd reports a busy
+    // instance of the plug-in; none otherwise, and when jobd cannot be asked (OMDPlugInBusy.cpp).
+    std::optional<Value> checkBusy() const;
 
     // Adds "extensions": a token for each resource the plug-in shares ("." alone for an app
     // extension), when it shares any.

@@ -2,10 +2,13 @@
 
 #include <algorithm>
 #include <mutex>
+#include <semaphore>
 
 #include "Ombrel/OMLog.h"
 #include "omd/OMDConduitClient.h"
 #include "omd/OMDPlugInHold.h"
+#include "platform/JobManager.h"
+#include "platform/Notify.h"
 #include "platform/RunLoop.h"
 
 namespace om {
@@ -23,14 +26,25 @@ ProcessServer& processServer()
     return *shared;
 }
 
-// FIXME: describe each record by its bundle identifier and UUID once the Registrar's record type
-// is in the tree; until then the records are opaque here and only their addresses can be shown.
 Value describeRecords(const RegistrarPlugInRecords& records)
 {
     ArrayBuilder described;
     for (const auto& record : records)
-        described.append(Value::string(format("<RegistrarPlugInRecord %p>", static_cast<const void*>(record.get()))));
+        described.append(Value::string(record->description()));
     return described.build();
+}
+
+// The version jobd knows an instance by: the one its bundle declares, else "1".
+std::string jobVersion(const RegistrarPlugInRecord& record)
+{
+    if (const std::string* version = record.infoDictionary().stringFor("VBBundleVersion"))
+        return *version;
+    return "1";
+}
+
+Value optionalText(const std::optional<std::string>& text)
+{
+    return text ? Value::string(*text) : Value();
 }
 
 } // namespace
@@ -117,9 +131,8 @@ void OMDServer::submitWork(std::function<void()> work)
 
 void OMDServer::removedPlugIns(const RegistrarPlugInRecords& records)
 {
-    // FIXME: stop the plug-ins' running instances (terminatePlugIns) and log from its completion,
-    // once holds and the job manager are in the tree. Until then there is nothing to wait for.
-    OMLog::ops().debug("removal complete for %@", describeRecords(records));
+    Value described = describeRecords(records);
+    terminatePlugIns(records, [described] { OMLog::ops().debug("removal complete for %@", described); });
 }
 
 bool OMDServer::holdOnPlugIn(const std::shared_ptr<OMDPlugIn>& plugIn)
@@ -131,10 +144,76 @@ bool OMDServer::holdOnPlugIn(const std::shared_ptr<OMDPlugIn>& plugIn)
     return held;
 }
 
-void OMDServer::unholdClient(const OMDConduitClient&)
+void OMDServer::addHold(std::shared_ptr<OMDPlugInHold> hold)
 {
-    // FIXME: walk m_holds on m_syncQueue once the "lock" request creates holds. Until then no
-    // client can own one, so a dying client has none to release.
+    m_syncQueue->sync([&] { m_holds.push_back(std::move(hold)); });
+    Notify::post(kAnnotationChangeNotification);
+}
+
+void OMDServer::unholdToken(const Uuid& token)
+{
+    m_syncQueue->sync([&] {
+        auto found
+            = std::find_if(m_holds.begin(), m_holds.end(), [&](const auto& hold) { return hold->uuid() == token; });
+        if (found == m_holds.end())
+            return;
+        OMLog::ops().debug("releasing plug-in hold %{public}@ at client's request", token.string());
+        m_holds.erase(found);
+        Notify::post(kAnnotationChangeNotification);
+    });
+}
+
+void OMDServer::unholdClient(const OMDConduitClient& client)
+{
+    m_syncQueue->sync([&] {
+        for (;;) {
+            auto found
+                = std::find_if(m_holds.begin(), m_holds.end(), [&](const auto& hold) { return hold->heldBy(client); });
+            if (found == m_holds.end())
+                return;
+            OMLog::ops().debug(
+                "releasing plug-in hold %{public}@ for dead client pid %d", (*found)->uuid().string(), client.pid());
+            m_holds.erase(found);
+            Notify::post(kAnnotationChangeNotification);
+        }
+    });
+}
+
+void OMDServer::terminatePlugIns(const RegistrarPlugInRecords& records, std::function<void()> reply)
+{
+    // Queues of this call alone: jobd's answers arrive on one, the wait for all of them runs on the
+    // other, so that neither the caller's queue nor another termination is held up.
+    auto killer = WorkQueue::create("killer");
+    auto waiter = WorkQueue::create("killer-waiter");
+    auto replies = std::make_shared<std::counting_semaphore<>>(0);
+    const int count = static_cast<int>(records.size());
+
+    for (const auto& record : records) {
+        const std::string version = jobVersion(*record);
+        const std::string uuid = record->uuid().string();
+        OMLog::ops().debug("requesting termination for %@(%@) jobd:%@ %@", optionalText(record->bundleIdentifier()),
+            optionalText(record->bundleVersion()), version, uuid);
+        JobManagerRemoveService(record->bundleIdentifier().value_or(""), version, killer, [uuid, replies](int status) {
+            if (status == kJobManagerSuccess)
+                OMLog::ops().info("one or more plug-ins have been terminated for uuid=%@", uuid);
+            else if (status == kJobManagerNothingOnRecord)
+                OMLog::ops().debug("jobd reported no plug-ins on record for uuid=%@", uuid);
+            else
+                OMLog::ops().error("jobd error attempting to terminate plug-ins: error=%d for uuid=%@", status, uuid);
+            replies->release();
+        });
+    }
+
+    // The block keeps both queues alive until every answer has been counted.
+    waiter->async([count, replies, reply = std::move(reply), killer, waiter] {
+        OMLog::ops().debug("waiting for %d termination replies", count);
+        for (int index = 0; index < count; ++index) {
+            OMLog::ops().debug("awaiting termination reply #%d", index);
+            replies->acquire();
+        }
+        OMLog::ops().debug("sending termination reply");
+        reply();
+    });
 }
 
 } // namespace om

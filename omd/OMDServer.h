@@ -46,8 +46,15 @@ public:
     void removedPlugIns(const RegistrarPlugInRecords& records) override;
     // True when a live hold blocks the plug-in. Enters "serverSync".
     bool holdOnPlugIn(const std::shared_ptr<OMDPlugIn>& plugIn);
+    // Appends the hold, then announces the change once "serverSync" is left.
+    void addHold(std::shared_ptr<OMDPlugInHold> hold);
+    // Releases the hold with this token, if there is one.
+    void unholdToken(const Uuid& token);
     // Releases every hold whose client is this very record. Called when its connection dies.
     void unholdClient(const OMDConduitClient& client);
+    // Asks jobd to stop the running instances of every record and returns at once; reply runs on
+    // a queue of this call's own once jobd has answered every request.
+    void terminatePlugIns(const RegistrarPlugInRecords& records, std::function<void()> reply);
 
     const std::shared_ptr<WorkQueue>& conduitQueue() const { return m_conduitQueue; }
     const std::shared_ptr<WorkQueue>& mainQueue() const { return m_mainQueue; }
@@ -64,8 +71,7 @@ private:
     std::shared_ptr<ConduitListener> m_service;
     // The user's preference domain: the plug-in exclusions.
     std::unique_ptr<OMDUserPrefs> m_userPrefs;
-    // Live holds in the order they were granted; touched only on m_syncQueue. Empty until the
-    // "lock" request exists.
+    // Live holds in the order they were granted; touched only on m_syncQueue.
     std::vector<std::shared_ptr<OMDPlugInHold>> m_holds;
     std::shared_ptr<WorkQueue> m_syncQueue;
 };

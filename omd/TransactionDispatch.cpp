@@ -43,9 +43,5 @@ void Transaction::accessPlugIns()
 {
     fail(4, "unrecognized request");
 }
-void Transaction::lockDownPlugIns()
-{
-    fail(4, "unrecognized request");
-}
 
 } // namespace om

@@ -32,7 +32,8 @@ bool RegistrarDaemon::start(std::vector<std::pair<std::string, std::string>> ext
     m_peer.reset();
     m_daemon.reset();
     DaemonProcess::Options options;
-    options.executable = builtDaemonPath();
+    options.executable = m_executable.value_or(builtDaemonPath());
+    options.conduitDirectory = m_conduitDirectory;
     options.arguments = { "-d", annotationsPath() };
     options.privateDatabase = false;
     options.environment = {

@@ -25,6 +25,10 @@ public:
     // Starts (or restarts, after stop) the daemon on the fixture's state; false when it does not
     // come up. extra settings are added to the environment.
     bool start(std::vector<std::pair<std::string, std::string>> extra = {});
+    // From the next start on: run this binary instead of the built omd (an entitled copy), on this
+    // Conduit directory (one that jobd listens in).
+    void setExecutable(std::string executable) { m_executable = std::move(executable); }
+    void setConduitDirectory(std::string directory) { m_conduitDirectory = std::move(directory); }
     DaemonProcess& daemon() { return *m_daemon; }
     BundleFixture& state() { return m_state; }
     std::string annotationsPath() const { return m_state.root() + "/annotations.vlist"; }
@@ -57,6 +61,8 @@ public:
 
 private:
     BundleFixture m_state;
+    std::optional<std::string> m_executable;
+    std::optional<std::string> m_conduitDirectory;
     std::unique_ptr<DaemonProcess> m_daemon;
     std::optional<DaemonPeer> m_peer;
     unsigned m_requestFiles = 0;

@@ -9,6 +9,7 @@
 #include "tools/omctl/OmctlAnnotation.h"
 #include "tools/omctl/OmctlDiagnostics.h"
 #include "tools/omctl/OmctlDiscovery.h"
+#include "tools/omctl/OmctlHold.h"
 #include "tools/omctl/OmctlRegistrar.h"
 #include "tools/omctl/OmctlRegistration.h"
 #include "tools/omctl/OmctlWatch.h"
@@ -30,6 +31,8 @@ const OmctlCommand::Entry kCommands[] = {
     { "watch", "print omd's annotation-change notifications as they come", OmctlWatch::kHelp, OmctlWatch::watch },
     { "add", "register plug-in bundles", OmctlRegistration::kAddHelp, OmctlRegistration::add },
     { "remove", "unregister plug-in bundles", OmctlRegistration::kRemoveHelp, OmctlRegistration::remove },
+    { "hold", "hold plug-ins out of discovery, optionally stopping them", OmctlHold::kHoldHelp, OmctlHold::hold },
+    { "release", "release a plug-in hold by its token", OmctlHold::kReleaseHelp, OmctlHold::release },
     { "registrar", "list registered apps and plug-ins from the Registrar's database", OmctlRegistrar::kHelp,
         OmctlRegistrar::registrar },
 };
