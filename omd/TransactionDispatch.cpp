@@ -35,14 +35,6 @@ void Transaction::runHandler(const std::string& name)
 // Placeholders. Every row of the table exists from the start so that its name is routed, but each
 // of these handlers still answers as if the name were unknown. Each one is replaced, and its line
 // here deleted, by the change that brings its request.
-void Transaction::readyPlugIns()
-{
-    fail(4, "unrecognized request");
-}
-void Transaction::accessPlugIns()
-{
-    fail(4, "unrecognized request");
-}
 void Transaction::lockDownPlugIns()
 {
     fail(4, "unrecognized request");
