@@ -54,8 +54,8 @@ std::set<std::string> OMDPlugIn::allowedConsentServices() const
     // Nothing is cached between queries: each one reads the store anew.
     auto entries = Consent::informationForBundle(Consent::defaultPath(), *identifier);
     if (!entries.ok()) {
-        OMLog::ops().info("ConsentAccessCopyInformationForBundle failed for %@",
-            Value::string(bundle->path().value_or(*containing)));
+        OMLog::ops().info(
+            "ConsentAccessCopyInformationForBundle failed for %@", Value::string(bundle->path().value_or(*containing)));
         OMLog::ops().debug("%s", entries.error().localizedDescription());
         return services;
     }
@@ -135,7 +135,7 @@ std::optional<OMError> OMDPlugIn::enableForClient(const OMDConduitClient& client
     OMLog::ops().info("assigning plug-in %@(%@) %{public}@ to %s sandbox", identifier, version(), uuid, profile);
 
     const Value overlay = Value::dictionary({
-        { "ConduitService", ValueTreeConversion::toConduit(description).value_or(Value()) },
+        { "ConduitService", ValueTreeConversion::toConduit(description).value_or(description) },
         { "VBBundlePackageType", "CND!" },
     });
     OMLog::ops().notice("allowing host %d %@ to use plug-in %@(%@) uuid=%{public}@ at %@", client.pid(), hostPath,

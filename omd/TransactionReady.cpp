@@ -39,14 +39,14 @@ void Transaction::readyPlugIns()
         if (server()->holdOnPlugIn(plugIn)) {
             OMLog::ops().notice(
                 "denied access to %d for plugin %@(%{public}@): the plug-in is on hold", pid, identifier, uuid);
-            fail(11, format("access to plugin %@ denied: %@", identifier, kOnHoldReason));
+            fail(11, format("access to plugin %@ denied: %@", identifier, Value::string(kOnHoldReason)));
             return false;
         }
         if (plugIn->isData())
             return true;
         if (auto reason = plugIn->allowForClient(*m_client)) {
-            OMLog::ops().notice(
-                "denied access to %d for plugin %@(%{public}@): %{public}@", pid, identifier, uuid, Value::string(*reason));
+            OMLog::ops().notice("denied access to %d for plugin %@(%{public}@): %{public}@", pid, identifier, uuid,
+                Value::string(*reason));
             fail(11, format("access to plugin %@ denied: %@", identifier, Value::string(*reason)));
             return false;
         }

@@ -65,7 +65,8 @@ Consent::~Consent()
 OMError Consent::failure(const std::string& what) const
 {
     return OMError(kErrorDomain, 1,
-        "consent database " + m_path + ": " + what + ": " + (m_database ? sqlite3_errmsg(m_database) : "out of memory"));
+        "consent database " + m_path + ": " + what + ": "
+            + (m_database ? sqlite3_errmsg(m_database) : "out of memory"));
 }
 
 Result<std::unique_ptr<Consent>> Consent::open(const std::string& path, Access access)
@@ -163,8 +164,8 @@ Result<std::vector<Consent::Entry>> Consent::entries(const std::string& bundleId
     int status = SQLITE_ROW;
     while ((status = sqlite3_step(query.statement)) == SQLITE_ROW) {
         const auto* service = reinterpret_cast<const char*>(sqlite3_column_text(query.statement, 0));
-        found.push_back(Entry { .service = service ? service : "",
-            .granted = sqlite3_column_int(query.statement, 1) != 0 });
+        found.push_back(
+            Entry { .service = service ? service : "", .granted = sqlite3_column_int(query.statement, 1) != 0 });
     }
     if (status != SQLITE_DONE)
         return failure("reading grants");

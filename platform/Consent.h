@@ -35,7 +35,8 @@ public:
     static Result<std::unique_ptr<Consent>> open(const std::string& path, Access access);
     // The entries of bundleIdentifier from the file at path, in the order they were first
     // recorded. A missing file holds no entries; it is not an error.
-    static Result<std::vector<Entry>> informationForBundle(const std::string& path, const std::string& bundleIdentifier);
+    static Result<std::vector<Entry>> informationForBundle(
+        const std::string& path, const std::string& bundleIdentifier);
 
     ~Consent();
     Consent(const Consent&) = delete;

@@ -27,12 +27,12 @@ std::string RegistrarDaemon::samplesPath()
     return std::string(OM_BINARY_DIR) + "/samples";
 }
 
-bool RegistrarDaemon::start(std::vector<std::pair<std::string, std::string>> extra)
+bool RegistrarDaemon::start(std::vector<std::pair<std::string, std::string>> extra, std::string executable)
 {
     m_peer.reset();
     m_daemon.reset();
     DaemonProcess::Options options;
-    options.executable = builtDaemonPath();
+    options.executable = executable.empty() ? builtDaemonPath() : std::move(executable);
     options.arguments = { "-d", annotationsPath() };
     options.privateDatabase = false;
     options.environment = {

@@ -23,8 +23,9 @@ public:
     RegistrarDaemon() = default;
 
     // Starts (or restarts, after stop) the daemon on the fixture's state; false when it does not
-    // come up. extra settings are added to the environment.
-    bool start(std::vector<std::pair<std::string, std::string>> extra = {});
+    // come up. extra settings are added to the environment; executable replaces the built daemon
+    // (an entitled copy of it, say).
+    bool start(std::vector<std::pair<std::string, std::string>> extra = {}, std::string executable = {});
     DaemonProcess& daemon() { return *m_daemon; }
     BundleFixture& state() { return m_state; }
     std::string annotationsPath() const { return m_state.root() + "/annotations.vlist"; }
