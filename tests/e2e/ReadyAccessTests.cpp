@@ -122,7 +122,7 @@ TEST_F(ReadyAccess, AccessGivesOneVerifiableTokenPerListedPlugInInOrder)
             EXPECT_FALSE(reply.contains("extensions"));
             continue;
         }
-        const Value tokens = reply["extensions"];
+        const Value& tokens = reply["extensions"];
         ASSERT_TRUE(tokens.isArray());
         ASSERT_EQ(tokens.count(), c.plugIns.size());
         for (size_t i = 0; i < c.plugIns.size(); ++i) {
