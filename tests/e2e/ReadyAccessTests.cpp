@@ -39,6 +39,10 @@ protected:
         plugIn("guarded", kPoint, Value(), { { "QSExtensionHostEntitlement", "com.example.guard" } });
         plugIn("keyboard-open", kKeyboardPoint, Value::dictionary({ { "RequestsOpenAccess", true } }));
         plugIn("keyboard-closed", kKeyboardPoint);
+        plugIn("declared", kPoint, Value(), {},
+            Value::dictionary(
+                { { "EnvironmentVariables", Value::dictionary({ { "HOME", "/declared" }, { "EXTRA", "x" } }) },
+                    { "_SandboxProfile", "keyboard" }, { "_OmitSandboxParameters", false }, { "Custom", "kept" } }));
         // The instance program answers once launched, so a launch can be seen to work.
         m_omd.copyProgram(toolPath("jobd_test_instance"), m_paths["a"] + "/Run");
         std::vector<std::string> paths;
@@ -54,10 +58,13 @@ protected:
         ::setenv("SANDBOX_KEY", (m_omd.daemon().root() + "/sandbox.key").c_str(), 1);
     }
 
+    // service: the bundle's declared "ConduitService", when not none.
     void plugIn(const std::string& name, const char* point, const Value& attributes = Value(),
-        const std::vector<Value::Entry>& keys = {})
+        const std::vector<Value::Entry>& keys = {}, const Value& service = Value())
     {
         DictionaryBuilder info(BundleFixture::plugInInfo("com.example." + name, "Run", point, attributes));
+        if (!service.isNone())
+            info.set("ConduitService", service);
         DictionaryBuilder extension(info.get("QSExtension"));
         for (const auto& [key, value] : keys)
             extension.set(key, value);
@@ -197,6 +204,52 @@ TEST_F(ReadyAccess, AKeyboardGetsTheFullPlugInSandboxOnlyWithOpenAccessAndConsen
         const size_t before = loggedLines(prefix, suffix);
         request("ready", { c.plugIn });
         EXPECT_EQ(loggedLines(prefix, suffix), before + 1);
+    }
+}
+
+TEST_F(ReadyAccess, TheOverlayKeepsTheDeclaredServiceUnderTheDaemonsEnvironmentAndProfile)
+{
+    const auto registrar = m_omd.registrar();
+    ASSERT_TRUE(registrar);
+    // The overlay the daemon should send: declared keys keep their places, and declared variables
+    // come after the daemon's unless they replace one of them.
+    auto overlay = [&](const std::string& name, const Value& home, const std::vector<Value::Entry>& variables,
+                       const std::vector<Value::Entry>& declared) {
+        const auto container = registrar->plugInAtPath(m_paths[name])->dataContainerPath();
+        EXPECT_TRUE(container);
+        const std::string path = container.value_or("");
+        DictionaryBuilder environment;
+        environment.set("HOME", home.isNone() ? Value(path) : home)
+            .set("VBFIXED_USER_HOME", path)
+            .set("TMPDIR", path + "/tmp");
+        for (const auto& [key, value] : variables)
+            environment.set(key, value);
+        DictionaryBuilder service;
+        service.set("EnvironmentVariables", environment.build())
+            .set("_SandboxProfile", "plugin")
+            .set("_OmitSandboxParameters", true);
+        for (const auto& [key, value] : declared)
+            service.set(key, value);
+        return Value::dictionary({ { "ConduitService", service.build() }, { "VBBundlePackageType", "CND!" } });
+    };
+    struct Case {
+        const char* plugIn;
+        Value expected;
+    };
+    const Case cases[] = {
+        { "a", overlay("a", Value(), {}, {}) },
+        // The declared HOME wins, the declared profile and flag are replaced, the rest passes.
+        { "declared", overlay("declared", "/declared", { { "EXTRA", "x" } }, { { "Custom", "kept" } }) },
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(c.plugIn);
+        const size_t before = loggedLines("activation overlay=");
+        request("ready", { c.plugIn });
+        ASSERT_EQ(loggedLines("activation overlay="), before + 1);
+        std::string logged;
+        for (const auto& line : m_omd.daemon().lines())
+            logged = line.message.starts_with("activation overlay=") ? line.message : logged;
+        EXPECT_EQ(logged, "activation overlay=" + c.expected.description());
     }
 }
 
