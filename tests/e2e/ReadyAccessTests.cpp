@@ -344,5 +344,31 @@ TEST_F(ReadyWithJobd, TheHostCanLaunchWhatItWasReadiedForWithItsContainerAsHome)
     EXPECT_EQ(ping["home"], Value::string(*container));
 }
 
+TEST_F(ReadyWithJobd, OmctlLaunchReadiesItselfAndTalksToTheInstance)
+{
+    struct Case {
+        std::vector<std::string> arguments;
+        int status;
+        std::string out; // the start of standard output
+    };
+    const Case cases[] = {
+        { { "launch", m_uuids.at("a").string() }, 0, "launched " },
+        // A plug-in the host is refused: omd's code and message, nothing launched.
+        { { "launch", m_uuids.at("guarded").string() }, 1, "" },
+        { { "launch" }, 2, "" },
+    };
+    for (const auto& c : cases) {
+        SCOPED_TRACE(::testing::PrintToString(c.arguments));
+        std::vector<std::string> arguments = c.arguments;
+        arguments.insert(arguments.begin(), RegistrarDaemon::omctlPath());
+        const auto outcome = ChildProcess::capture(arguments,
+            { { "CONDUIT_DIR", m_omd.daemon().conduitDirectory() }, { "JOBD_SERVICE_NAME", kJobManagerServiceName } });
+        EXPECT_EQ(outcome.status, c.status) << outcome.err;
+        EXPECT_TRUE(outcome.out.starts_with(c.out)) << outcome.out;
+        if (c.status == 0)
+            EXPECT_NE(outcome.out.find("home"), std::string::npos) << outcome.out;
+    }
+}
+
 } // namespace
 } // namespace om::test
