@@ -15,6 +15,7 @@ OMDConduitClient::OMDConduitClient(
     : m_connection(connection)
     , m_server(std::move(server))
     , m_pid(connection->pid())
+    , m_auditToken(connection->auditToken())
 {
 }
 

@@ -13,6 +13,7 @@
 #include <string_view>
 
 #include "platform/Conduit.h"
+#include "platform/Process.h"
 #include "platform/Value.h"
 
 namespace om {
@@ -36,6 +37,8 @@ public:
     void dead();
 
     pid_t pid() const;
+    // The peer as pinned when it connected (pid with its pidfd): what grants made for it name.
+    const AuditToken& auditToken() const { return m_auditToken; }
     // None when the entitlement is absent or cannot be read.
     Value entitlementValueForKey(std::string_view key) const;
     // Held unless absent, false or numerically zero.
@@ -83,6 +86,7 @@ private:
     uint32_t m_requestCount = 0;
     // The pid as first read; answered once the connection object is gone (nothing relies on it).
     pid_t m_pid = -1;
+    AuditToken m_auditToken;
 };
 
 } // namespace om

@@ -9,6 +9,7 @@
 
 #include <memory>
 #include <optional>
+#include <set>
 #include <string>
 #include <string_view>
 
@@ -68,6 +69,13 @@ public:
     // instance of the plug-in; none otherwise, and when jobd cannot be asked (OMDPlugInBusy.cpp).
     std::optional<Value> checkBusy() const;
 
+    // Lets the host launch the plug-in through the job manager (OMDPlugInLaunch.cpp). An error of
+    // code 4 when the plug-in has no executable or the job manager refuses.
+    std::optional<OMError> enableForClient(const OMDConduitClient& client) const;
+    // The consent services the user granted to the containing application; empty when there is
+    // none or the consent store cannot say.
+    std::set<std::string> allowedConsentServices() const;
+
     // Adds "extensions": a token for each resource the plug-in shares ("." alone for an app
     // extension), when it shares any.
     void augmentForm(DictionaryBuilder& form) const;
@@ -75,6 +83,14 @@ public:
     Value issueResourceExtensions(const Value& resources) const;
 
 private:
+    // The launch environment before the declared variables: the data container and OMTEST_SDK.
+    Value launchEnvironment() const;
+    // The job manager's sandbox profile for this plug-in.
+    std::string sandboxProfile() const;
+    // The service description jobd receives: the declared "ConduitService" with the environment
+    // (declared variables winning) and the profile over it.
+    Value serviceDescription(const Value& base, const std::string& profile) const;
+
     explicit OMDPlugIn(std::shared_ptr<const RegistrarPlugInRecord> record)
         : m_rgproxy(std::move(record))
     {

@@ -12,7 +12,6 @@ void Transaction::runHandler(const std::string& name)
         std::string_view name;
         void (Transaction::*run)();
     };
-    // Each handler is still a placeholder for now; see the end of this file.
     static constexpr std::array<Handler, 9> kHandlers { {
         { "add", &Transaction::addPlugIns },
         { "remove", &Transaction::removePlugIns },
@@ -29,18 +28,6 @@ void Transaction::runHandler(const std::string& name)
         if (handler.name == name)
             return (this->*handler.run)();
     }
-    fail(4, "unrecognized request");
-}
-
-// Placeholders. Every row of the table exists from the start so that its name is routed, but each
-// of these handlers still answers as if the name were unknown. Each one is replaced, and its line
-// here deleted, by the change that brings its request.
-void Transaction::readyPlugIns()
-{
-    fail(4, "unrecognized request");
-}
-void Transaction::accessPlugIns()
-{
     fail(4, "unrecognized request");
 }
 

@@ -213,8 +213,9 @@ TEST_F(OMDAnnotationStoreTest, BadFileResetsAndIsKeptAtTheFirstSave)
         EXPECT_EQ(errors[0].category, "ops");
         EXPECT_TRUE(message.starts_with(std::string(kResetPrefix) + OMBundle::fileURL(path()) + " error:")) << message;
         EXPECT_TRUE(message.ends_with(kResetSuffix)) << message;
-        if (test.errorText)
+        if (test.errorText) {
             EXPECT_NE(message.find(test.errorText), std::string::npos) << message;
+        }
 
         // Nothing is written, and nothing kept, before a change.
         EXPECT_EQ(readBytes(path()), test.contents);

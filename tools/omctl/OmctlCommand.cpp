@@ -7,9 +7,11 @@
 
 #include "platform/Format.h"
 #include "tools/omctl/OmctlAnnotation.h"
+#include "tools/omctl/OmctlConsent.h"
 #include "tools/omctl/OmctlDiagnostics.h"
 #include "tools/omctl/OmctlDiscovery.h"
 #include "tools/omctl/OmctlHold.h"
+#include "tools/omctl/OmctlReady.h"
 #include "tools/omctl/OmctlRegistrar.h"
 #include "tools/omctl/OmctlRegistration.h"
 #include "tools/omctl/OmctlWatch.h"
@@ -33,6 +35,12 @@ const OmctlCommand::Entry kCommands[] = {
     { "remove", "unregister plug-in bundles", OmctlRegistration::kRemoveHelp, OmctlRegistration::remove },
     { "hold", "hold plug-ins out of discovery, optionally stopping them", OmctlHold::kHoldHelp, OmctlHold::hold },
     { "release", "release a plug-in hold by its token", OmctlHold::kReleaseHelp, OmctlHold::release },
+    { "ready", "let omctl's own process launch plug-ins (through jobd)", OmctlReady::kReadyHelp, OmctlReady::ready },
+    { "access", "print read tokens for plug-ins' bundles", OmctlReady::kAccessHelp, OmctlReady::access },
+    { "launch", "ready a plug-in, launch it through jobd and send it one line", OmctlReady::kLaunchHelp,
+        OmctlReady::launch },
+    { "consent", "grant, revoke or list an application's privacy consents", OmctlConsent::kHelp,
+        OmctlConsent::consent },
     { "registrar", "list registered apps and plug-ins from the Registrar's database", OmctlRegistrar::kHelp,
         OmctlRegistrar::registrar },
 };
