@@ -8,7 +8,6 @@
 #include "omd/OMDConduitClient.h"
 #include "omd/OMDPlugInHold.h"
 #include "platform/JobManager.h"
-#include "platform/Notify.h"
 #include "platform/RunLoop.h"
 
 namespace om {
@@ -147,7 +146,7 @@ bool OMDServer::holdOnPlugIn(const std::shared_ptr<OMDPlugIn>& plugIn)
 void OMDServer::addHold(std::shared_ptr<OMDPlugInHold> hold)
 {
     m_syncQueue->sync([&] { m_holds.push_back(std::move(hold)); });
-    Notify::post(kAnnotationChangeNotification);
+    notifyAnnotationChange();
 }
 
 void OMDServer::unholdToken(const Uuid& token)
@@ -159,7 +158,7 @@ void OMDServer::unholdToken(const Uuid& token)
             return;
         OMLog::ops().debug("releasing plug-in hold %{public}@ at client's request", token.string());
         m_holds.erase(found);
-        Notify::post(kAnnotationChangeNotification);
+        notifyAnnotationChange();
     });
 }
 
@@ -174,7 +173,7 @@ void OMDServer::unholdClient(const OMDConduitClient& client)
             OMLog::ops().debug(
                 "releasing plug-in hold %{public}@ for dead client pid %d", (*found)->uuid().string(), client.pid());
             m_holds.erase(found);
-            Notify::post(kAnnotationChangeNotification);
+            notifyAnnotationChange();
         }
     });
 }
