@@ -24,9 +24,10 @@ TEST(OMDAnnotationText, AssembledTextIsTheWholeTableWrittenAtOnceThroughEveryCha
     const std::vector<std::pair<std::string, Value>> changes {
         { "com.example.a", Value::dictionary({ { "election", 1 } }) },
         { "com.example.b", Value::dictionary({}) }, // written on its key's line
-        { "com.example.c&<>\"'", Value::dictionary({ { "extension",
-            Value::dictionary({ { "list", Value::array({ Value::string("x < y"), Value::real(0.5) }) },
-                { "when", Value::date(0) }, { "bytes", Value::data(std::vector<uint8_t> { 0, 255 }) } }) } }) },
+        { "com.example.c&<>\"'",
+            Value::dictionary({ { "extension",
+                Value::dictionary({ { "list", Value::array({ Value::string("x < y"), Value::real(0.5) }) },
+                    { "when", Value::date(0) }, { "bytes", Value::data(std::vector<uint8_t> { 0, 255 }) } }) } }) },
         { "com.example.a", Value::dictionary({ { "election", Value::boolean(true) } }) }, // equal, written otherwise
         { "com.example.b", Value() }, // removed
         { "", Value::dictionary({ { "election", 0 } }) },
