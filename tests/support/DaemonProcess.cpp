@@ -39,10 +39,13 @@ int remainingMilliseconds(Clock::time_point deadline)
     return static_cast<int>(std::clamp<long long>(left, 0, INT_MAX));
 }
 
-bool isSocket(const std::string& path)
+// The identity of the socket file at path; none when there is none.
+std::optional<std::pair<dev_t, ino_t>> socketIdentity(const std::string& path)
 {
     struct stat info;
-    return ::stat(path.c_str(), &info) == 0 && S_ISSOCK(info.st_mode);
+    if (::stat(path.c_str(), &info) != 0 || !S_ISSOCK(info.st_mode))
+        return std::nullopt;
+    return std::pair { info.st_dev, info.st_ino };
 }
 
 std::string makeTemporaryRoot()
@@ -192,6 +195,8 @@ DaemonProcess::DaemonProcess(Options options)
 {
     m_conduitDirectory = options.conduitDirectory.value_or(m_root + "/conduit");
     std::filesystem::create_directories(m_conduitDirectory);
+    // A predecessor that died without cleaning up left its socket in a shared directory.
+    m_staleSocket = socketIdentity(socketPath());
     if (options.user) {
         // The daemon must be able to make its socket and files in its own directories.
         uid_t user = *options.user;
@@ -295,8 +300,13 @@ bool DaemonProcess::waitForSocket(std::chrono::milliseconds timeout)
     UniqueFd watch(::inotify_init1(IN_CLOEXEC | IN_NONBLOCK));
     if (!watch.valid() || ::inotify_add_watch(watch.get(), m_conduitDirectory.c_str(), IN_CREATE | IN_MOVED_TO) < 0)
         return false;
-    // The watch exists before this check, so a socket made after it is never missed.
-    while (!isSocket(socketPath())) {
+    // The watch exists before this check, so a socket made after it is never missed. A socket left
+    // by a predecessor is not this process's.
+    const auto ours = [&] {
+        const auto identity = socketIdentity(socketPath());
+        return identity && identity != m_staleSocket;
+    };
+    while (!ours()) {
         std::array<pollfd, 2> fds { { { watch.get(), POLLIN, 0 }, { m_pidfd.get(), POLLIN, 0 } } };
         int ready = ::poll(fds.data(), fds.size(), remainingMilliseconds(deadline));
         if (ready < 0 && errno == EINTR)
@@ -304,7 +314,7 @@ bool DaemonProcess::waitForSocket(std::chrono::milliseconds timeout)
         if (ready <= 0)
             return false;
         if (fds[1].revents)
-            return isSocket(socketPath());
+            return ours();
         std::array<char, 4096> events;
         while (::read(watch.get(), events.data(), events.size()) > 0) { }
     }

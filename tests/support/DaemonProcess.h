@@ -72,7 +72,8 @@ public:
     const std::string& serviceName() const { return m_serviceName; }
     std::string socketPath() const { return m_conduitDirectory + "/" + m_serviceName; }
 
-    // True once the service's socket exists; false when the process exits first or time runs out.
+    // True once the service's socket exists, made by this process rather than left behind by a
+    // predecessor on a shared directory; false when the process exits first or time runs out.
     bool waitForSocket(std::chrono::milliseconds timeout = kDaemonTimeout);
 
     std::vector<DaemonLogLine> lines() const;
@@ -135,6 +136,7 @@ private:
     UniqueFd m_stderr;
     UniqueFd m_stopReader; // eventfd: tells the reader thread to give up
     std::optional<int> m_status;
+    std::optional<std::pair<dev_t, ino_t>> m_staleSocket; // the socket file found before the start
 
     mutable std::mutex m_mutex;
     std::condition_variable m_changed;
