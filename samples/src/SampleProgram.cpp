@@ -139,8 +139,8 @@ int main()
     // NOLINTNEXTLINE(concurrency-mt-unsafe): read before any thread starts.
     if (const char* fdText = std::getenv(om::kJobManagerInstanceFdVariable))
         return serve(std::atoi(fdText), name, bundle->path().value_or(""));
-    std::printf("%s running (pid %d)\n", name.c_str(), static_cast<int>(::getpid()));
-    std::fflush(stdout);
+    (void)std::printf("%s running (pid %d)\n", name.c_str(), static_cast<int>(::getpid()));
+    (void)std::fflush(stdout);
     for (;;)
         ::pause();
 }
