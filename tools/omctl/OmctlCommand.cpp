@@ -11,6 +11,7 @@
 #include "tools/omctl/OmctlDiagnostics.h"
 #include "tools/omctl/OmctlDiscovery.h"
 #include "tools/omctl/OmctlHold.h"
+#include "tools/omctl/OmctlJobs.h"
 #include "tools/omctl/OmctlReady.h"
 #include "tools/omctl/OmctlRegistrar.h"
 #include "tools/omctl/OmctlRegistration.h"
@@ -39,6 +40,7 @@ const OmctlCommand::Entry kCommands[] = {
     { "access", "print read tokens for plug-ins' bundles", OmctlReady::kAccessHelp, OmctlReady::access },
     { "launch", "ready a plug-in, launch it through jobd and send it one line", OmctlReady::kLaunchHelp,
         OmctlReady::launch },
+    { "ps", "list the plug-in instances jobd is running", OmctlJobs::kPsHelp, OmctlJobs::ps },
     { "consent", "grant, revoke or list an application's privacy consents", OmctlConsent::kHelp,
         OmctlConsent::consent },
     { "registrar", "list registered apps and plug-ins from the Registrar's database", OmctlRegistrar::kHelp,
