@@ -337,8 +337,9 @@ TEST_F(HoldsWithJobd, ABusyInstanceRefusesACheckedHoldAndAnIdleOneDoesNot)
         EXPECT_EQ(codeOf(reply), row.code);
         EXPECT_EQ(reply["conflicts"], row.conflicts);
         EXPECT_EQ(reply["uuids"].isNone(), row.code != 0);
-        if (row.code != 0)
+        if (row.code != 0) {
             EXPECT_EQ(errorOf(reply), "plug-ins are busy");
+        }
     }
     // Without the flag a busy plug-in is held all the same.
     ASSERT_EQ(instance->ask(Value::dictionary({ { "op", "busy" } }))["status"].asInt64(), 0);

@@ -366,8 +366,9 @@ TEST_F(ReadyWithJobd, OmctlLaunchReadiesItselfAndTalksToTheInstance)
             { { "CONDUIT_DIR", m_omd.daemon().conduitDirectory() }, { "JOBD_SERVICE_NAME", kJobManagerServiceName } });
         EXPECT_EQ(outcome.status, c.status) << outcome.err;
         EXPECT_TRUE(outcome.out.starts_with(c.out)) << outcome.out;
-        if (c.status == 0)
+        if (c.status == 0) {
             EXPECT_NE(outcome.out.find("home"), std::string::npos) << outcome.out;
+        }
     }
 }
 
