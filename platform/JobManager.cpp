@@ -2,8 +2,10 @@
 
 #include <condition_variable>
 #include <cstdlib>
+#include <map>
 #include <mutex>
 #include <optional>
+#include <thread>
 
 #include "platform/Conduit.h"
 
@@ -95,6 +97,49 @@ int addService(const AuditToken& host, uint64_t startTime, const std::string& ex
         kReplyTimeout);
 }
 
+// Cancels connections still open at their deadline, which answers their pending requests as
+// unreachable. One thread for every asynchronous call, started with the first; it holds the
+// connections weakly, so an answered call leaves only an expired entry behind.
+void cancelAfter(const std::shared_ptr<ConduitConnection>& connection, std::chrono::seconds limit)
+{
+    struct Watchdog {
+        std::mutex mutex;
+        std::condition_variable changed;
+        std::multimap<std::chrono::steady_clock::time_point, std::weak_ptr<ConduitConnection>> deadlines;
+
+        void run()
+        {
+            std::unique_lock lock(mutex);
+            for (;;) {
+                if (deadlines.empty()) {
+                    changed.wait(lock);
+                    continue;
+                }
+                auto first = deadlines.begin();
+                if (changed.wait_until(lock, first->first) == std::cv_status::no_timeout)
+                    continue;
+                auto expired = deadlines.begin()->second.lock();
+                deadlines.erase(deadlines.begin());
+                lock.unlock();
+                if (expired)
+                    expired->cancel();
+                expired.reset();
+                lock.lock();
+            }
+        }
+    };
+    static Watchdog* watchdog = [] {
+        auto* made = new Watchdog; // lives as long as the process; its thread never ends
+        std::thread([made] { made->run(); }).detach();
+        return made;
+    }();
+    {
+        std::lock_guard lock(watchdog->mutex);
+        watchdog->deadlines.emplace(std::chrono::steady_clock::now() + limit, connection);
+    }
+    watchdog->changed.notify_one();
+}
+
 } // namespace
 
 void JobManagerSetServiceName(const std::string& serviceName)
@@ -144,6 +189,8 @@ void JobManagerRemoveService(const std::string& bundleIdentifier, const std::str
     auto connection = ConduitConnection::connectToService(JobManagerServiceName(), nullptr);
     connection->setEventHandler([](const ConduitEvent&) {});
     connection->resume();
+    // A jobd that stops answering (stopped, not dead) must not keep the caller waiting for ever.
+    cancelAfter(connection, kRemoveTimeout);
     // The connection stays alive through its own pending request; it ends with the answer.
     connection->sendWithReply(
         Value::dictionary({ { "request", "remove" }, { "identifier", bundleIdentifier }, { "version", version } }),
