@@ -7,7 +7,7 @@
 #include <utility>
 
 #include "platform/Format.h"
-#include "tests/support/PrivateBus.h"
+#include "tests/support/ChangeCounter.h"
 #include "tests/support/RegistrarDaemon.h"
 
 namespace om::test {
@@ -15,7 +15,6 @@ namespace {
 
 const std::string kShare = RegistrarDaemon::samplesPath() + "/Notes.app/PlugIns/Share.appex";
 const std::string kKeyboard = RegistrarDaemon::samplesPath() + "/Keys.app/PlugIns/Keyboard.appex";
-constexpr const char* kChange = "com.orvex.ombrel.annotation-change";
 
 // The daemon and a listener meet on a private message bus, so that no other test's notifications
 // are counted.
@@ -23,28 +22,12 @@ class AnnotationRequests : public ::testing::Test {
 protected:
     void SetUp() override
     {
-        m_bus = std::make_unique<PrivateBus>(m_omd.state().root());
-        const std::string& address = m_bus->address();
-        ASSERT_FALSE(address.empty()) << "dbus-daemon did not start: " << m_bus->log();
-        auto listener = helper(std::string(OM_BINARY_DIR) + "/tests/om_test_listener", { kChange });
-        listener.environment.emplace_back("DBUS_SESSION_BUS_ADDRESS", address);
-        m_listener = std::make_unique<DaemonProcess>(listener);
-        ASSERT_TRUE(m_listener->waitForMessage("ready")) << m_listener->stderrText();
-
-        ASSERT_TRUE(m_omd.start({ { "DBUS_SESSION_BUS_ADDRESS", address } }));
+        m_changes = std::make_unique<ChangeCounter>(m_omd.state().root());
+        ASSERT_EQ(m_changes->failure(), "");
+        ASSERT_TRUE(m_omd.start({ m_changes->busSetting() }));
         ASSERT_EQ(codeOf(m_omd.add({ kShare, kKeyboard })), 0u);
         m_share = *m_omd.uuidAt(kShare);
         m_keyboard = *m_omd.uuidAt(kKeyboard);
-    }
-
-    static DaemonProcess::Options helper(std::string executable, std::vector<std::string> arguments)
-    {
-        DaemonProcess::Options options;
-        options.executable = std::move(executable);
-        options.arguments = std::move(arguments);
-        options.logLevel.clear();
-        options.privateDatabase = false;
-        return options;
     }
 
     Value annotate(const std::vector<Value>& uuids, const Value& annotations)
@@ -69,23 +52,12 @@ protected:
         return forms.empty() ? Value() : forms[0]["annotations"];
     }
 
-    // How many change notifications the daemon posted since the last call, once the listener has
-    // received every one of them. The daemon logs each post before the reply that follows it.
-    size_t announced()
-    {
-        m_omd.readLogSoFar();
-        const size_t posted = m_omd.daemon().countMessages(std::string("posting ") + kChange);
-        EXPECT_TRUE(m_listener->waitForMessageCount(kChange, posted) || posted == 0) << m_listener->stderrText();
-        EXPECT_EQ(m_listener->countMessages(kChange), posted);
-        return posted - std::exchange(m_announced, posted);
-    }
+    size_t announced() { return m_changes->announcedSince(m_omd); }
 
-    std::unique_ptr<PrivateBus> m_bus;
-    std::unique_ptr<DaemonProcess> m_listener;
+    std::unique_ptr<ChangeCounter> m_changes;
     RegistrarDaemon m_omd;
     Uuid m_share;
     Uuid m_keyboard;
-    size_t m_announced = 0;
 };
 
 TEST_F(AnnotationRequests, RefusalsCarryTheirCodeAndTextAndStoreNothing)

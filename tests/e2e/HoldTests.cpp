@@ -11,6 +11,7 @@
 #include "Ombrel/OMDaemonClient.h"
 #include "platform/Format.h"
 #include "tests/e2e/JobdTestSupport.h"
+#include "tests/support/ChangeCounter.h"
 #include "tests/support/RegistrarDaemon.h"
 
 namespace om::test {
@@ -21,7 +22,6 @@ const std::string kKeys = RegistrarDaemon::samplesPath() + "/Keys.app";
 const std::string kPhotos = RegistrarDaemon::samplesPath() + "/Photos.app";
 const std::string kShare = kNotes + "/PlugIns/Share.appex";
 const std::string kKeyboard = kKeys + "/PlugIns/Keyboard.appex";
-constexpr const char* kChange = "com.orvex.ombrel.annotation-change";
 constexpr uint64_t kPlugInPaths = OMDaemonClient::OMLockFlagPlugInPaths;
 
 Value lockRequest(const std::vector<std::string>& paths, uint64_t flags)
@@ -37,38 +37,15 @@ Value releaseRequest(const std::vector<Uuid>& tokens)
     return DictionaryBuilder(daemonRequest("lock")).set("uuids", uuids.build()).build();
 }
 
-DaemonProcess::Options helper(std::string executable, std::vector<std::string> arguments)
-{
-    DaemonProcess::Options options;
-    options.executable = std::move(executable);
-    options.arguments = std::move(arguments);
-    options.logLevel.clear();
-    options.privateDatabase = false;
-    return options;
-}
-
 // The daemon and a listener meet on a private message bus, so that only this test's
 // notifications are counted.
 class Holds : public ::testing::Test {
 protected:
     void SetUp() override
     {
-        m_bus = std::make_unique<DaemonProcess>(helper("/usr/bin/dbus-daemon",
-            { "--session", "--nofork", "--address=unix:path=" + m_omd.state().root() + "/bus", "--print-address=2" }));
-        std::string address;
-        ASSERT_TRUE(m_bus->waitForLines([&](const auto& lines) {
-            for (const auto& line : lines) {
-                if (line.raw.starts_with("unix:"))
-                    address = line.raw;
-            }
-            return !address.empty();
-        })) << m_bus->stderrText();
-        auto listener = helper(std::string(OM_BINARY_DIR) + "/tests/om_test_listener", { kChange });
-        listener.environment.emplace_back("DBUS_SESSION_BUS_ADDRESS", address);
-        m_listener = std::make_unique<DaemonProcess>(listener);
-        ASSERT_TRUE(m_listener->waitForMessage("ready")) << m_listener->stderrText();
-
-        ASSERT_TRUE(m_omd.start({ { "DBUS_SESSION_BUS_ADDRESS", address } }));
+        m_changes = std::make_unique<ChangeCounter>(m_omd.state().root());
+        ASSERT_EQ(m_changes->failure(), "");
+        ASSERT_TRUE(m_omd.start({ m_changes->busSetting() }));
         ASSERT_EQ(codeOf(m_omd.add({ kShare, kKeyboard })), 0u);
         m_share = m_omd.uuidAt(kShare)->string();
         m_keyboard = m_omd.uuidAt(kKeyboard)->string();
@@ -76,23 +53,12 @@ protected:
 
     std::set<std::string> visible() { return uuidsIn(m_omd.match(Value())); }
 
-    // How many change notifications the daemon posted since the last call, once the listener has
-    // received every one of them.
-    size_t announced()
-    {
-        m_omd.readLogSoFar();
-        const size_t posted = m_omd.daemon().countMessages(std::string("posting ") + kChange);
-        EXPECT_TRUE(m_listener->waitForMessageCount(kChange, posted) || posted == 0) << m_listener->stderrText();
-        EXPECT_EQ(m_listener->countMessages(kChange), posted);
-        return posted - std::exchange(m_announced, posted);
-    }
+    size_t announced() { return m_changes->announcedSince(m_omd); }
 
-    std::unique_ptr<DaemonProcess> m_bus;
-    std::unique_ptr<DaemonProcess> m_listener;
+    std::unique_ptr<ChangeCounter> m_changes;
     RegistrarDaemon m_omd;
     std::string m_share;
     std::string m_keyboard;
-    size_t m_announced = 0;
 };
 
 TEST_F(Holds, AHoldHidesItsPlugInsUntilReleasedWithOneNotificationPerChange)
