@@ -190,18 +190,18 @@ Value OMPlugInCore::version() const
 
 Value OMPlugInCore::protocolSpec() const
 {
-    Value spec = pluginKey("QSExtensionProtocol");
-    if (spec.isNone() && isAppExtension())
+    Value value = pluginKey("QSExtensionProtocol");
+    if (value.isNone() && isAppExtension())
         return Value(kDefaultAppExtensionSpec);
-    return spec;
+    return value;
 }
 
 Value OMPlugInCore::principalSpec() const
 {
-    Value spec = pluginKey("PrincipalClass");
-    if (spec.isNone() && isAppExtension())
+    Value value = pluginKey("PrincipalClass");
+    if (value.isNone() && isAppExtension())
         return Value(kDefaultAppExtensionSpec);
-    return spec;
+    return value;
 }
 
 Value OMPlugInCore::sdkSpec() const
@@ -211,8 +211,8 @@ Value OMPlugInCore::sdkSpec() const
 
 Value OMPlugInCore::embeddedProtocolSpec() const
 {
-    Value spec = pluginKey("EmbeddedProtocol");
-    return spec.isNone() ? protocolSpec() : spec;
+    Value value = pluginKey("EmbeddedProtocol");
+    return value.isNone() ? protocolSpec() : value;
 }
 
 std::optional<std::string> OMPlugInCore::embeddedCodePath() const

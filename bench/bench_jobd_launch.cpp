@@ -144,14 +144,14 @@ void BM_LaunchBwrapDirectly(benchmark::State& state)
         state.SkipWithError("jobd setup failed");
         return;
     }
-    auto spec = om::JobSpec::fromOverlay(setup().executable, setup().overlay);
+    auto job = om::JobSpec::fromOverlay(setup().executable, setup().overlay);
     auto profile = om::SandboxProfile::load(om::SandboxProfile::directory(), "plugin");
-    if (!spec.ok() || !profile.ok()) {
-        state.SkipWithError("no spec or profile");
+    if (!job.ok() || !profile.ok()) {
+        state.SkipWithError("no job or profile");
         return;
     }
-    const auto arguments = profile.value()->arguments(spec.value(), {});
-    std::map<std::string, std::string> environment = spec->environment;
+    const auto arguments = profile.value()->arguments(job.value(), {});
+    std::map<std::string, std::string> environment = job->environment;
     environment["JOBD_INSTANCE_FD"] = "3";
     environment["PATH"] = "/usr/bin:/bin";
     for (auto _ : state) {

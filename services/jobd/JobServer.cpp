@@ -151,7 +151,7 @@ void JobServer::closed(const std::shared_ptr<Client>& client)
     for (auto& [id, instance] : m_instances) {
         if (instance->busyOwner == client.get()) {
             log().info("instance %d of %s is idle: its assertion connection closed", instance->pid,
-                instance->spec->bundleIdentifier);
+                instance->job->bundleIdentifier);
             instance->busyOwner = nullptr;
         }
     }

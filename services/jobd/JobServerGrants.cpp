@@ -16,9 +16,9 @@ namespace {
 // Variables of jobd's own environment that an instance inherits unless its overlay sets them.
 constexpr const char* kInheritedVariables[] = { "EVLOG_LEVEL", "EVLOG_STDERR", "SANDBOX_KEY" };
 
-std::map<std::string, std::string> instanceEnvironment(const JobSpec& spec, const std::string& serviceName)
+std::map<std::string, std::string> instanceEnvironment(const JobSpec& job, const std::string& serviceName)
 {
-    auto environment = spec.environment;
+    auto environment = job.environment;
     environment.try_emplace("PATH", "/usr/bin:/bin");
     for (const char* name : kInheritedVariables) {
         // NOLINTNEXTLINE(concurrency-mt-unsafe): jobd never changes its environment.
@@ -44,10 +44,10 @@ void JobServer::addService(const std::shared_ptr<Request>& request)
     const auto* path = message.stringFor("path");
     if (!pid || *pid <= 0 || *pid > INT32_MAX || !start || !path)
         return reply(*request, kJobManagerInvalid, "\"add\" needs pid, start and path");
-    auto spec = JobSpec::fromOverlay(*path, message["overlay"]);
-    if (!spec.ok())
-        return reply(*request, kJobManagerInvalid, spec.error().localizedDescription());
-    if (auto profile = SandboxProfile::load(m_profiles, spec->profile); !profile.ok())
+    auto job = JobSpec::fromOverlay(*path, message["overlay"]);
+    if (!job.ok())
+        return reply(*request, kJobManagerInvalid, job.error().localizedDescription());
+    if (auto profile = SandboxProfile::load(m_profiles, job->profile); !profile.ok())
         return reply(*request, kJobManagerInvalid, profile.error().localizedDescription());
 
     auto found = m_hosts.find(pid_t(*pid));
@@ -84,7 +84,7 @@ void JobServer::addService(const std::shared_ptr<Request>& request)
     }
 
     auto& grants = found->second->grants;
-    auto shared = std::make_shared<const JobSpec>(std::move(spec).releaseValue());
+    auto shared = std::make_shared<const JobSpec>(std::move(job).releaseValue());
     auto same = std::find_if(grants.begin(), grants.end(),
         [&](const auto& grant) { return grant->executablePath == shared->executablePath; });
     if (same != grants.end()) {
@@ -125,19 +125,19 @@ void JobServer::launch(const std::shared_ptr<Request>& request)
         return reply(*request, kJobManagerNotPermitted, "pid " + std::to_string(peer.pid) + " holds no grant");
     }
     auto grant = std::find_if(host->grants.begin(), host->grants.end(),
-        [&](const auto& spec) { return spec->executablePath == *target || spec->bundleIdentifier == *target; });
+        [&](const auto& job) { return job->executablePath == *target || job->bundleIdentifier == *target; });
     if (grant == host->grants.end()) {
         log().error("pid %d holds no grant for %s", peer.pid, *target);
         return reply(*request, kJobManagerNotPermitted, "no grant for " + *target);
     }
-    const auto spec = *grant;
+    const auto job = *grant;
     size_t running = 0;
     for (const auto& [id, instance] : m_instances)
         running += instance->hostPid == peer.pid ? 1 : 0;
     if (running >= kMaxInstancesPerHost)
         return reply(*request, kJobManagerLimit,
             "host " + std::to_string(peer.pid) + " runs " + std::to_string(running) + " instances, the most allowed");
-    auto profile = SandboxProfile::load(m_profiles, spec->profile);
+    auto profile = SandboxProfile::load(m_profiles, job->profile);
     if (!profile.ok())
         return reply(*request, kJobManagerLaunchFailed, profile.error().localizedDescription());
 
@@ -146,11 +146,11 @@ void JobServer::launch(const std::shared_ptr<Request>& request)
         return reply(*request, kJobManagerLaunchFailed, OMError::fromErrno("socketpair", errno).localizedDescription());
     UniqueFd hostEnd(pair[0]);
     UniqueFd instanceEnd(pair[1]);
-    auto child = JobLauncher::spawn(m_bwrap, profile.value()->arguments(*spec, Conduit::socketPath(m_serviceName)),
-        instanceEnvironment(*spec, m_serviceName), instanceEnd, kJobManagerInstanceFd);
+    auto child = JobLauncher::spawn(m_bwrap, profile.value()->arguments(*job, Conduit::socketPath(m_serviceName)),
+        instanceEnvironment(*job, m_serviceName), instanceEnd, kJobManagerInstanceFd);
     instanceEnd.reset();
     if (!child.ok()) {
-        log().error("cannot launch %s: %s", spec->executablePath, child.error().localizedDescription());
+        log().error("cannot launch %s: %s", job->executablePath, child.error().localizedDescription());
         return reply(*request, kJobManagerLaunchFailed, child.error().localizedDescription());
     }
 
@@ -159,14 +159,14 @@ void JobServer::launch(const std::shared_ptr<Request>& request)
     instance->pid = child->pid;
     instance->pidfd = std::move(child->pidfd);
     instance->hostPid = peer.pid;
-    instance->spec = spec;
+    instance->job = job;
     std::weak_ptr<JobServer> weak = shared_from_this();
     instance->watchKey = m_watcher->watch(instance->pidfd.get(), [weak, id = instance->id] {
         if (auto self = weak.lock())
             self->instanceExited(id);
     });
     log().notice(
-        "launched %s for host %d: pid %d, profile %s", spec->bundleIdentifier, peer.pid, instance->pid, spec->profile);
+        "launched %s for host %d: pid %d, profile %s", job->bundleIdentifier, peer.pid, instance->pid, job->profile);
     const pid_t pid = instance->pid;
     m_instances.emplace(instance->id, std::move(instance));
 
@@ -174,7 +174,7 @@ void JobServer::launch(const std::shared_ptr<Request>& request)
     descriptors.push_back(std::move(hostEnd));
     reply(*request,
         Value::dictionary({ { "status", int64_t(kJobManagerSuccess) }, { "pid", int64_t(pid) },
-            { "identifier", spec->bundleIdentifier } }),
+            { "identifier", job->bundleIdentifier } }),
         std::move(descriptors));
 }
 

@@ -67,14 +67,14 @@ void JobServer::removeService(const std::shared_ptr<Request>& request)
     if (!identifier || !version)
         return reply(*request, kJobManagerInvalid, "\"remove\" needs identifier and version");
     const auto matches
-        = [&](const JobSpec& spec) { return spec.bundleIdentifier == *identifier && spec.version == *version; };
+        = [&](const JobSpec& job) { return job.bundleIdentifier == *identifier && job.version == *version; };
     // No host may start it again: what is being removed is being replaced or uninstalled.
     for (auto& [pid, host] : m_hosts)
         std::erase_if(host->grants, [&](const auto& grant) { return matches(*grant); });
 
     std::vector<Instance*> stopping;
     for (auto& [id, instance] : m_instances) {
-        if (matches(*instance->spec))
+        if (matches(*instance->job))
             stopping.push_back(instance.get());
     }
     if (stopping.empty()) {
@@ -113,7 +113,7 @@ void JobServer::killAfterGrace(uint64_t instanceId)
         return;
     Instance& instance = *found->second;
     log().notice("instance %d of %s did not stop within %lld ms; killing it", instance.pid,
-        instance.spec->bundleIdentifier, static_cast<long long>(killGrace().count()));
+        instance.job->bundleIdentifier, static_cast<long long>(killGrace().count()));
     // Killing the sandbox's first process ends its whole pid namespace; bwrap follows once the
     // namespace is empty, so the instance is gone when bwrap is reaped.
     const auto inside = descendantsOf(instance.pid);
@@ -135,10 +135,10 @@ void JobServer::instanceExited(uint64_t instanceId)
         log().error("waitid for instance %d: %s", instance->pid, OMError::errnoDescription(errno));
     else if (info.si_code == CLD_EXITED)
         log().info(
-            "instance %d of %s exited with status %d", instance->pid, instance->spec->bundleIdentifier, info.si_status);
+            "instance %d of %s exited with status %d", instance->pid, instance->job->bundleIdentifier, info.si_status);
     else
         log().info(
-            "instance %d of %s ended by signal %d", instance->pid, instance->spec->bundleIdentifier, info.si_status);
+            "instance %d of %s ended by signal %d", instance->pid, instance->job->bundleIdentifier, info.si_status);
     for (auto& done : instance->whenGone)
         done();
 }
@@ -151,9 +151,9 @@ void JobServer::list(const std::shared_ptr<Request>& request)
     for (const auto& [id, instance] : m_instances) {
         instances.push_back(Value::dictionary({
             { "host", int64_t(instance->hostPid) },
-            { kJobManagerBundleIdentifierKey, instance->spec->bundleIdentifier },
+            { kJobManagerBundleIdentifierKey, instance->job->bundleIdentifier },
             { "pid", int64_t(instance->pid) },
-            { "profile", instance->spec->profile },
+            { "profile", instance->job->profile },
             { "busy", Value::boolean(instance->busyOwner != nullptr) },
         }));
     }
@@ -192,7 +192,7 @@ void JobServer::assertBusy(const std::shared_ptr<Request>& request)
         return reply(*request, kJobManagerNothingOnRecord, "not an instance launched by jobd");
     }
     instance->busyOwner = *busy ? request->client.get() : nullptr;
-    log().info("instance %d of %s is %s", instance->pid, instance->spec->bundleIdentifier, *busy ? "busy" : "idle");
+    log().info("instance %d of %s is %s", instance->pid, instance->job->bundleIdentifier, *busy ? "busy" : "idle");
     reply(*request, kJobManagerSuccess);
 }
 
@@ -210,10 +210,9 @@ void JobServer::busy(const std::shared_ptr<Request>& request)
     }
     std::vector<Value> instances;
     for (const auto& [id, instance] : m_instances) {
-        if (instance->busyOwner && wanted.contains(instance->spec->bundleIdentifier))
-            instances.push_back(
-                Value::dictionary({ { kJobManagerBundleIdentifierKey, instance->spec->bundleIdentifier },
-                    { "pid", int64_t(instance->pid) } }));
+        if (instance->busyOwner && wanted.contains(instance->job->bundleIdentifier))
+            instances.push_back(Value::dictionary({ { kJobManagerBundleIdentifierKey, instance->job->bundleIdentifier },
+                { "pid", int64_t(instance->pid) } }));
     }
     reply(*request,
         Value::dictionary({ { "status", int64_t(kJobManagerSuccess) }, { "instances", Value::array(instances) } }));

@@ -42,7 +42,7 @@ struct JobServer::Instance {
     UniqueFd pidfd;
     uint64_t watchKey = 0;
     pid_t hostPid = -1;
-    std::shared_ptr<const JobSpec> spec;
+    std::shared_ptr<const JobSpec> job;
     const Client* busyOwner = nullptr; // the connection that declared the instance busy
     bool terminating = false;
     std::vector<std::function<void()>> whenGone;

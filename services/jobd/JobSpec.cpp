@@ -76,7 +76,7 @@ Result<std::vector<std::string>> readExtensions(const Value& tokens)
 
 Result<JobSpec> JobSpec::fromOverlay(const std::string& executablePath, const Value& overlay)
 {
-    JobSpec spec;
+    JobSpec job;
     if (executablePath.empty() || executablePath[0] != '/')
         return invalid("executable path is not absolute: " + executablePath);
     struct stat file { };
@@ -90,11 +90,11 @@ Result<JobSpec> JobSpec::fromOverlay(const std::string& executablePath, const Va
     const auto* identifier = info["VBBundleIdentifier"].asString();
     if (!identifier || identifier->empty())
         return invalid("bundle " + *bundle->bundlePath() + " has no identifier");
-    spec.executablePath = bundle->executablePath().value_or(executablePath);
-    spec.bundlePath = *bundle->bundlePath();
-    spec.bundleIdentifier = *identifier;
+    job.executablePath = bundle->executablePath().value_or(executablePath);
+    job.bundlePath = *bundle->bundlePath();
+    job.bundleIdentifier = *identifier;
     const auto* version = info["VBBundleVersion"].asString();
-    spec.version = version ? *version : "1";
+    job.version = version ? *version : "1";
 
     if (overlay.type() != Value::Type::Dictionary)
         return invalid("overlay is not a dictionary");
@@ -102,17 +102,17 @@ Result<JobSpec> JobSpec::fromOverlay(const std::string& executablePath, const Va
     if (service.type() != Value::Type::Dictionary)
         return invalid("overlay has no ConduitService dictionary");
     const auto* profile = service["_SandboxProfile"].asString();
-    spec.profile = profile ? *profile : "plugin";
-    if (!isProfileName(spec.profile))
+    job.profile = profile ? *profile : "plugin";
+    if (!isProfileName(job.profile))
         return invalid("malformed sandbox profile name");
-    spec.environment = OM_TRY(readEnvironment(service["EnvironmentVariables"]));
-    spec.readablePaths = OM_TRY(readExtensions(service["_SandboxExtensions"]));
-    if (auto home = spec.environment.find("HOME"); home != spec.environment.end() && !home->second.empty()) {
+    job.environment = OM_TRY(readEnvironment(service["EnvironmentVariables"]));
+    job.readablePaths = OM_TRY(readExtensions(service["_SandboxExtensions"]));
+    if (auto home = job.environment.find("HOME"); home != job.environment.end() && !home->second.empty()) {
         if (home->second[0] != '/')
             return invalid("HOME is not absolute");
-        spec.home = home->second;
+        job.home = home->second;
     }
-    return spec;
+    return job;
 }
 
 } // namespace om

@@ -93,7 +93,7 @@ Result<std::shared_ptr<const SandboxProfile>> SandboxProfile::load(
     return std::shared_ptr<const SandboxProfile>(std::move(profile));
 }
 
-std::vector<std::string> SandboxProfile::arguments(const JobSpec& spec, const std::string& jobdSocket) const
+std::vector<std::string> SandboxProfile::arguments(const JobSpec& job, const std::string& jobdSocket) const
 {
     std::vector<std::string> args;
     for (const auto& space : m_unshare)
@@ -111,14 +111,14 @@ std::vector<std::string> SandboxProfile::arguments(const JobSpec& spec, const st
         args.insert(args.end(), { "--dev", "/dev" });
     // The private /tmp first: the binds below may lie inside it and must land on top of it.
     args.insert(args.end(), { "--tmpfs", "/tmp" });
-    args.insert(args.end(), { "--ro-bind", spec.bundlePath, spec.bundlePath });
-    if (spec.home && exists(*spec.home))
-        args.insert(args.end(), { "--bind", *spec.home, *spec.home, "--chdir", *spec.home });
-    for (const auto& path : spec.readablePaths)
+    args.insert(args.end(), { "--ro-bind", job.bundlePath, job.bundlePath });
+    if (job.home && exists(*job.home))
+        args.insert(args.end(), { "--bind", *job.home, *job.home, "--chdir", *job.home });
+    for (const auto& path : job.readablePaths)
         args.insert(args.end(), { "--ro-bind-try", path, path });
     if (!jobdSocket.empty() && exists(jobdSocket))
         args.insert(args.end(), { "--ro-bind", jobdSocket, jobdSocket });
-    args.insert(args.end(), { "--", spec.executablePath });
+    args.insert(args.end(), { "--", job.executablePath });
     return args;
 }
 

@@ -34,9 +34,9 @@ public:
     const std::string& name() const { return m_name; }
     bool network() const { return m_network; }
 
-    // bwrap's arguments (without argv[0]) to run spec's executable; jobdSocket is bound so that the
+    // bwrap's arguments (without argv[0]) to run job's executable; jobdSocket is bound so that the
     // job can reach jobd.
-    std::vector<std::string> arguments(const JobSpec& spec, const std::string& jobdSocket) const;
+    std::vector<std::string> arguments(const JobSpec& job, const std::string& jobdSocket) const;
 
 private:
     SandboxProfile() = default;
