@@ -240,4 +240,33 @@ Result<Value> JobManagerCall(const Value& request)
     return checked(answer);
 }
 
+bool JobManagerServeInstance(const std::function<Value(const Value& request)>& answer)
+{
+    const char* fdText = std::getenv(kJobManagerInstanceFdVariable); // NOLINT(concurrency-mt-unsafe)
+    if (!fdText)
+        return false;
+    auto queue = WorkQueue::create("instance");
+    auto connection = ConduitConnection::adoptSocket(UniqueFd(std::atoi(fdText)), queue);
+    std::mutex mutex;
+    std::condition_variable closed;
+    bool done = false;
+    connection->setEventHandler([&](const ConduitEvent& event) {
+        if (event.kind == ConduitEvent::Kind::ConnectionInvalid) {
+            std::lock_guard lock(mutex);
+            done = true;
+            closed.notify_all();
+            return;
+        }
+        const Value reply = answer(event.message);
+        if (event.expectsReply())
+            connection->sendReply(event.requestId, reply);
+    });
+    connection->resume();
+    std::unique_lock lock(mutex);
+    closed.wait(lock, [&] { return done; });
+    lock.unlock();
+    connection->cancel();
+    return true;
+}
+
 } // namespace om

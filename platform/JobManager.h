@@ -94,6 +94,11 @@ Result<std::vector<JobInstanceInfo>> JobManagerList();
 // error whose code is the status. For the other clients of jobd (process assertions).
 Result<Value> JobManagerCall(const Value& request);
 
+// The instance side: answers each request on the host connection jobd gave this process (the
+// descriptor named by kJobManagerInstanceFdVariable) with answer's reply, until the host closes
+// it. False at once when this process was not started by jobd.
+bool JobManagerServeInstance(const std::function<Value(const Value& request)>& answer);
+
 // Service name to use instead of kJobManagerServiceName (tests, a second jobd); empty restores
 // it. Without one, JOBD_SERVICE_NAME (which jobd sets for its instances) is used when set.
 void JobManagerSetServiceName(const std::string& serviceName);

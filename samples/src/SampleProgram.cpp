@@ -11,16 +11,13 @@
 #include <signal.h>
 #include <unistd.h>
 
-#include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
-#include <mutex>
 #include <string>
 
 #include "Ombrel/OMBundle.h"
 #include "platform/Assertions.h"
-#include "platform/Conduit.h"
 #include "platform/JobManager.h"
 
 namespace {
@@ -102,33 +99,6 @@ private:
     bool m_held = false;
 };
 
-int serve(int fd, const std::string& identifier, const std::string& bundlePath)
-{
-    auto queue = om::WorkQueue::create("sample-instance");
-    auto connection = om::ConduitConnection::adoptSocket(om::UniqueFd(fd), queue);
-    Instance instance(identifier, bundlePath);
-    std::mutex mutex;
-    std::condition_variable closed;
-    bool done = false;
-    connection->setEventHandler([&](const om::ConduitEvent& event) {
-        if (event.kind == om::ConduitEvent::Kind::ConnectionInvalid) {
-            std::lock_guard lock(mutex);
-            done = true;
-            closed.notify_all();
-            return;
-        }
-        const std::string* op = event.message.stringFor("op");
-        const om::Value reply = instance.answer(op ? *op : "ping");
-        if (event.expectsReply())
-            connection->sendReply(event.requestId, reply);
-    });
-    connection->resume();
-    std::unique_lock lock(mutex);
-    closed.wait(lock, [&] { return done; });
-    connection->cancel();
-    return 0;
-}
-
 } // namespace
 
 int main()
@@ -136,9 +106,13 @@ int main()
     auto bundle = om::OMBundle::initForMainBundle();
     auto identifier = bundle->bundleIdentifier();
     const std::string name = identifier ? *identifier : "sample";
-    // NOLINTNEXTLINE(concurrency-mt-unsafe): read before any thread starts.
-    if (const char* fdText = std::getenv(om::kJobManagerInstanceFdVariable))
-        return serve(std::atoi(fdText), name, bundle->path().value_or(""));
+    Instance instance(name, bundle->path().value_or(""));
+    const bool served = om::JobManagerServeInstance([&](const om::Value& request) {
+        const std::string* op = request.stringFor("op");
+        return instance.answer(op ? *op : "ping");
+    });
+    if (served)
+        return 0;
     (void)std::printf("%s running (pid %d)\n", name.c_str(), static_cast<int>(::getpid()));
     (void)std::fflush(stdout);
     for (;;)

@@ -107,8 +107,9 @@ TEST_F(Samples, TheSampleHostFindsReadiesLaunchesAndPrintsThePlugInsOwnReply)
             ASSERT_NE(at, std::string::npos) << expected << " in\n" << outcome.out;
         }
         EXPECT_NE(outcome.err.find(row.err), std::string::npos) << outcome.err;
-        if (row.status != 0)
+        if (row.status != 0) {
             EXPECT_EQ(outcome.out.find("launching"), std::string::npos) << outcome.out;
+        }
     }
 }
 

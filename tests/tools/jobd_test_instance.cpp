@@ -13,12 +13,9 @@
 #include <unistd.h>
 
 #include <cerrno>
-#include <condition_variable>
 #include <cstdlib>
-#include <mutex>
 
 #include "platform/Assertions.h"
-#include "platform/Conduit.h"
 #include "platform/JobManager.h"
 
 #include <arpa/inet.h>
@@ -71,24 +68,9 @@ int main()
     // NOLINTBEGIN(concurrency-mt-unsafe): read before any thread starts.
     if (const char* ignore = std::getenv("JOBD_TEST_IGNORE_TERM"); ignore && std::string(ignore) == "1")
         ::signal(SIGTERM, SIG_IGN);
-    const char* fdText = std::getenv(om::kJobManagerInstanceFdVariable);
     // NOLINTEND(concurrency-mt-unsafe)
-    if (!fdText)
-        return 2;
-    auto queue = om::WorkQueue::create("instance");
-    auto connection = om::ConduitConnection::adoptSocket(om::UniqueFd(std::atoi(fdText)), queue);
     std::shared_ptr<om::Assertions> assertions;
-    std::mutex mutex;
-    std::condition_variable closed;
-    bool done = false;
-    connection->setEventHandler([&](const om::ConduitEvent& event) {
-        if (event.kind == om::ConduitEvent::Kind::ConnectionInvalid) {
-            std::lock_guard lock(mutex);
-            done = true;
-            closed.notify_all();
-            return;
-        }
-        const om::Value& request = event.message;
+    const bool served = om::JobManagerServeInstance([&](const om::Value& request) {
         const std::string op = request.stringFor("op") ? *request.stringFor("op") : "";
         om::Value reply;
         if (op == "ping") {
@@ -107,11 +89,7 @@ int main()
         } else {
             reply = om::Value::dictionary({ { "error", "unknown op" } });
         }
-        if (event.expectsReply())
-            connection->sendReply(event.requestId, reply);
+        return reply;
     });
-    connection->resume();
-    std::unique_lock lock(mutex);
-    closed.wait(lock, [&] { return done; });
-    return 0;
+    return served ? 0 : 2;
 }
