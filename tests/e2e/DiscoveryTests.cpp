@@ -38,15 +38,10 @@ protected:
         // Outside the system and outside any application: registered, but never a plug-in anyone
         // sees, not even a manager asking for everything.
         plugIn("stray", m_bundles.root() + "/Loose/Stray.appex");
-        std::vector<std::string> paths;
-        for (const auto& [name, path] : m_paths)
-            paths.push_back(path);
-        ASSERT_EQ(codeOf(m_omd.add(paths)), 0u);
-        for (const auto& [name, path] : m_paths) {
-            auto uuid = m_omd.uuidAt(path);
-            ASSERT_TRUE(uuid) << path;
-            m_names[uuid->string()] = name;
-        }
+        const auto uuids = m_omd.addNamed(m_paths);
+        ASSERT_EQ(uuids.size(), m_paths.size());
+        for (const auto& [name, uuid] : uuids)
+            m_names[uuid.string()] = name;
     }
 
     // An application whose executable is a real client program, so that it can ask as itself.

@@ -10,6 +10,7 @@
 #include <fstream>
 #include <map>
 #include <memory>
+#include <optional>
 #include <string>
 #include <vector>
 
@@ -75,6 +76,21 @@ private:
     std::shared_ptr<ConduitConnection> m_connection;
 };
 
+// The built jobd serving service, its tokens checked under key; on conduitDirectory when given
+// (omd's, say), else on a directory of its own.
+inline DaemonProcess::Options jobdOptions(const std::string& service, const std::string& key,
+    const std::string& killGraceMs, std::optional<std::string> conduitDirectory = std::nullopt)
+{
+    DaemonProcess::Options options;
+    options.executable = std::string(OM_BINARY_DIR) + "/services/jobd/jobd";
+    options.arguments = { "-S", service };
+    options.conduitDirectory = std::move(conduitDirectory);
+    options.privateDatabase = false;
+    options.environment = { { "JOBD_PROFILES_DIR", std::string(OM_SOURCE_DIR) + "/services/jobd/profiles" },
+        { "JOBD_KILL_GRACE_MS", killGraceMs }, { "SANDBOX_KEY", key } };
+    return options;
+}
+
 class JobdTest : public ::testing::Test {
 protected:
     virtual std::string killGraceMs() const { return "30000"; }
@@ -87,13 +103,7 @@ protected:
         m_dir = pattern;
         const std::string key = m_dir + "/sandbox.key";
         ::setenv("SANDBOX_KEY", key.c_str(), 1);
-        DaemonProcess::Options options;
-        options.executable = std::string(OM_BINARY_DIR) + "/services/jobd/jobd";
-        options.arguments = { "-S", kJobdTestService };
-        options.privateDatabase = false;
-        options.environment = { { "JOBD_PROFILES_DIR", std::string(OM_SOURCE_DIR) + "/services/jobd/profiles" },
-            { "JOBD_KILL_GRACE_MS", killGraceMs() }, { "SANDBOX_KEY", key } };
-        m_jobd = std::make_unique<DaemonProcess>(options);
+        m_jobd = std::make_unique<DaemonProcess>(jobdOptions(kJobdTestService, key, killGraceMs()));
         ASSERT_TRUE(m_jobd->waitForSocket());
         ::setenv("CONDUIT_DIR", m_jobd->conduitDirectory().c_str(), 1);
         JobManagerSetServiceName(kJobdTestService);

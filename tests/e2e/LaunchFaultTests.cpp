@@ -38,12 +38,8 @@ protected:
         plugIn("b");
         // Declared variables reach the instance: this one outlives SIGTERM.
         plugIn("stubborn", Value::dictionary({ { "JOBD_TEST_IGNORE_TERM", "1" } }));
-        std::vector<std::string> paths;
-        for (const auto& [name, path] : m_paths)
-            paths.push_back(path);
-        ASSERT_EQ(codeOf(m_omd.add(paths)), 0u);
-        for (const auto& [name, path] : m_paths)
-            m_uuids[name] = *m_omd.uuidAt(path);
+        m_uuids = m_omd.addNamed(m_paths);
+        ASSERT_EQ(m_uuids.size(), m_paths.size());
         ::setenv("SANDBOX_KEY", sandboxKey().c_str(), 1);
         // This process is the host: it launches what omd readied it for.
         ::setenv("CONDUIT_DIR", m_omd.daemon().conduitDirectory().c_str(), 1);
@@ -72,14 +68,8 @@ protected:
     // jobd on omd's Conduit directory, (re)started; the previous one, if any, is gone by then.
     bool startJobd()
     {
-        DaemonProcess::Options options;
-        options.executable = std::string(OM_BINARY_DIR) + "/services/jobd/jobd";
-        options.arguments = { "-S", kJobManagerServiceName };
-        options.conduitDirectory = m_omd.daemon().conduitDirectory();
-        options.privateDatabase = false;
-        options.environment = { { "JOBD_PROFILES_DIR", std::string(OM_SOURCE_DIR) + "/services/jobd/profiles" },
-            { "JOBD_KILL_GRACE_MS", kKillGraceMs }, { "SANDBOX_KEY", sandboxKey() } };
-        m_jobd = std::make_unique<DaemonProcess>(options);
+        m_jobd = std::make_unique<DaemonProcess>(
+            jobdOptions(kJobManagerServiceName, sandboxKey(), kKillGraceMs, m_omd.daemon().conduitDirectory()));
         return m_jobd->waitForSocket();
     }
     // jobd dies without a chance to clean up: its socket file stays behind.

@@ -46,15 +46,8 @@ protected:
                     { "_SandboxProfile", "keyboard" }, { "_OmitSandboxParameters", false }, { "Custom", "kept" } }));
         // The instance program answers once launched, so a launch can be seen to work.
         m_omd.copyProgram(toolPath("jobd_test_instance"), m_paths["a"] + "/Run");
-        std::vector<std::string> paths;
-        for (const auto& [name, path] : m_paths)
-            paths.push_back(path);
-        ASSERT_EQ(codeOf(m_omd.add(paths)), 0u);
-        for (const auto& [name, path] : m_paths) {
-            auto uuid = m_omd.uuidAt(path);
-            ASSERT_TRUE(uuid) << path;
-            m_uuids[name] = *uuid;
-        }
+        m_uuids = m_omd.addNamed(m_paths);
+        ASSERT_EQ(m_uuids.size(), m_paths.size());
         // Tokens are checked here under the daemon's key.
         ::setenv("SANDBOX_KEY", (m_omd.daemon().root() + "/sandbox.key").c_str(), 1);
     }
@@ -309,14 +302,8 @@ protected:
         ReadyAccess::SetUp();
         if (HasFatalFailure())
             return;
-        DaemonProcess::Options options;
-        options.executable = std::string(OM_BINARY_DIR) + "/services/jobd/jobd";
-        options.arguments = { "-S", kJobManagerServiceName };
-        options.conduitDirectory = m_omd.daemon().conduitDirectory();
-        options.privateDatabase = false;
-        options.environment = { { "JOBD_PROFILES_DIR", std::string(OM_SOURCE_DIR) + "/services/jobd/profiles" },
-            { "SANDBOX_KEY", m_omd.daemon().root() + "/sandbox.key" } };
-        m_jobd = std::make_unique<DaemonProcess>(options);
+        m_jobd = std::make_unique<DaemonProcess>(jobdOptions(
+            kJobManagerServiceName, m_omd.daemon().root() + "/sandbox.key", "5000", m_omd.daemon().conduitDirectory()));
         ASSERT_TRUE(m_jobd->waitForSocket());
         // This process is the host: it launches what the daemon readied it for.
         ::setenv("CONDUIT_DIR", m_omd.daemon().conduitDirectory().c_str(), 1);

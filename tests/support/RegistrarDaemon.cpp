@@ -67,6 +67,25 @@ Value RegistrarDaemon::add(const std::vector<std::string>& paths)
     return call(pathsRequest("add", paths));
 }
 
+std::map<std::string, Uuid> RegistrarDaemon::addNamed(const std::map<std::string, std::string>& paths)
+{
+    std::vector<std::string> list;
+    for (const auto& [name, path] : paths)
+        list.push_back(path);
+    const Value reply = add(list);
+    EXPECT_EQ(codeOf(reply), 0u) << errorOf(reply);
+    std::map<std::string, Uuid> uuids;
+    for (const auto& [name, path] : paths) {
+        auto uuid = uuidAt(path);
+        if (!uuid) {
+            ADD_FAILURE() << "not registered: " << path;
+            return {};
+        }
+        uuids.emplace(name, *uuid);
+    }
+    return uuids;
+}
+
 Value RegistrarDaemon::match(const Value& rules, uint64_t flags)
 {
     DictionaryBuilder request(daemonRequest("match"));

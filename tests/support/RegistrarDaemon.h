@@ -3,6 +3,7 @@
 // them again; with a raw peer connected, and helpers for entitled client programs.
 #pragma once
 
+#include <map>
 #include <memory>
 #include <optional>
 #include <set>
@@ -37,6 +38,9 @@ public:
     // A request over the raw peer; none (with a test failure) when no reply comes.
     Value call(const Value& request);
     Value add(const std::vector<std::string>& paths);
+    // Registers the bundles (name -> path) in one "add" and gives each name its UUID; empty, with
+    // a test failure, when the daemon refuses.
+    std::map<std::string, Uuid> addNamed(const std::map<std::string, std::string>& paths);
     // "match" from the raw peer; the reply with "matches" decoded.
     Value match(const Value& rules, uint64_t flags = 0);
 
