@@ -2,6 +2,7 @@
 // election prefilter pushed into the Registrar's query, turned into cached daemon records.
 #include <algorithm>
 #include <cmath>
+#include <span>
 #include <unordered_set>
 
 #include "Ombrel/OMLog.h"
@@ -50,18 +51,13 @@ std::optional<std::string> pushedDown(const Value& pattern)
 std::optional<std::vector<std::string>> OMDatabase::electionPrefilter(const Value& rules)
 {
     const Value& election = rules["QSUserElection"];
-    std::vector<std::string> texts;
-    if (election.isString()) {
-        auto text = pushedDown(election);
-        if (!text)
-            return std::nullopt;
-        texts.push_back(std::move(*text));
-        return texts;
-    }
-    if (!election.isArray())
+    if (!election.isString() && !election.isArray())
         return std::nullopt;
-    for (const Value& element : election.elements()) {
-        auto text = pushedDown(element);
+    // A single pattern counts as a list of one.
+    const auto patterns = election.isString() ? std::span<const Value>(&election, 1) : election.elements();
+    std::vector<std::string> texts;
+    for (const Value& pattern : patterns) {
+        auto text = pushedDown(pattern);
         if (!text)
             return std::nullopt;
         texts.push_back(std::move(*text));

@@ -1,6 +1,7 @@
 #include "platform/RegistrarIndex.h"
 
 #include <algorithm>
+#include <span>
 
 #include "platform/VersionString.h"
 
@@ -36,17 +37,12 @@ std::optional<std::string_view> equalityOperand(const Value& pattern)
 
 std::optional<std::vector<std::string>> RegistrarIndex::equalityKeys(const Value& pattern)
 {
-    std::vector<std::string> keys;
-    if (pattern.isString()) {
-        auto operand = equalityOperand(pattern);
-        if (!operand)
-            return std::nullopt;
-        keys.push_back(VersionString::equivalenceKey(*operand));
-        return keys;
-    }
-    if (!pattern.isArray())
+    if (!pattern.isString() && !pattern.isArray())
         return std::nullopt;
-    for (const Value& element : pattern.elements()) {
+    // A single pattern counts as a list of one.
+    const auto patterns = pattern.isString() ? std::span<const Value>(&pattern, 1) : pattern.elements();
+    std::vector<std::string> keys;
+    for (const Value& element : patterns) {
         auto operand = equalityOperand(element);
         if (!operand)
             return std::nullopt;
