@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <cmath>
 #include <span>
+#include <unordered_map>
 #include <unordered_set>
 
 #include "Ombrel/OMLog.h"
@@ -114,12 +115,21 @@ std::optional<OMDPlugIns> OMDatabase::findPlugIns(const Value& rules)
     const size_t cachedBefore = m_cachedCount.load(std::memory_order_relaxed);
     OMDPlugIns found;
     std::unordered_set<Uuid> seen;
+    // Whether an application is complete is read from the disk, once per application and query:
+    // its plug-ins share its record.
+    std::unordered_map<const RegistrarAppRecord*, bool> placeholders;
+    const auto isPlaceholder = [&](const RegistrarAppRecord& app) {
+        auto [entry, isNew] = placeholders.try_emplace(&app, false);
+        if (isNew)
+            entry->second = app.isPlaceholder();
+        return entry->second;
+    };
     for (const auto& record : records) {
         if (!record->bundlePath()) {
             OMLog::ops().info("skipping rg proxy %@ with nil bundleURL", record->description());
             continue;
         }
-        if (const auto& app = record->containingApp(); app && app->isPlaceholder()) {
+        if (const auto& app = record->containingApp(); app && isPlaceholder(*app)) {
             OMLog::ops().info("skipping rg proxy %@ because its app is a placeholder", record->description());
             continue;
         }
